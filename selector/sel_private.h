@@ -1,0 +1,83 @@
+/* Selector internals shared by the selector's source files, white-box tests
+ * and debuggers (which read SelContext through sel_tl_key). */
+#ifndef QORBU_SELECTOR_SEL_PRIVATE_H
+#define QORBU_SELECTOR_SEL_PRIVATE_H
+
+#include <signal.h>
+#include <stddef.h>
+
+#include "selector/sel.h"
+
+#ifdef __cplusplus
+#include <atomic>
+#endif
+
+#define QORBU_HIDDEN __attribute__((visibility("hidden")))
+
+#ifdef __cplusplus
+extern "C" {
+#endif
+
+/* One per selector thread. The field order is fixed: tools read it. */
+typedef struct SelContext {
+    sigset_t signals;   /* registered signals: blocked except while waiting */
+    fd_set readSet;     /* select-mode interest sets */
+    fd_set writeSet;
+    fd_set exceptSet;
+    int32_t nfds;       /* one past the highest select-mode registration */
+    int32_t scanStart;  /* where the next read/write scan begins */
+    SelFdEntry *fdTable;
+    int32_t fdTableSize;
+    SelTimer **timerHeap; /* slot 0: timer being fired; 1..timerCount: min-heap */
+    int32_t timerCount;
+    int32_t timerCapacity;
+    void *zg;           /* host context from SelSetZG */
+    fd_set readyRead;   /* working sets of the current wait */
+    fd_set readyWrite;
+    fd_set readyExcept;
+} SelContext;
+
+/* Internal operations, hidden from the library's users but linkable by the
+ * white-box tests (they link the static archive of the same objects). */
+QORBU_HIDDEN SelContext *SelCurrentContext(void);
+QORBU_HIDDEN void SelCreateKey(void);
+QORBU_HIDDEN void SelFreeContext(void *context);
+
+QORBU_HIDDEN int SelTimerBefore(const struct timespec *a, const struct timespec *b);
+QORBU_HIDDEN void SelHeapUp(SelContext *ctx, uint32_t slot);
+QORBU_HIDDEN void SelHeapDown(SelContext *ctx, uint32_t slot);
+QORBU_HIDDEN int SelRunTimers(SelContext *ctx);
+
+QORBU_HIDDEN SelFdEntry *SelFdSlot(SelContext *ctx, int fd);
+QORBU_HIDDEN void SelDispatchFD(SelContext *ctx, int fd, unsigned int event);
+
+QORBU_HIDDEN int SelReapIdleFDs(SelTimer *timer);
+
+QORBU_HIDDEN void SelDrainHostQueue(void *hostContext);
+
+#ifdef __cplusplus
+}
+
+namespace qorbu::sel {
+
+inline constexpr int kReaperPeriodSec = 30;
+inline constexpr int kIdleLimitSec = 25;
+inline constexpr int kReaperExitThreshold = 800;
+inline constexpr int kMaxTimersPerRun = 101;
+inline constexpr int kSelectSetSize = FD_SETSIZE;
+inline constexpr int kMaxSignal = 64;
+inline constexpr int kTimerMisuse = -117;
+inline constexpr int kErestart = 85;
+
+/* The process-wide epoll instance; 0 means select mode. */
+QORBU_HIDDEN extern std::atomic<int> epoll_fd;
+inline int current_epoll_fd() { return epoll_fd.load(std::memory_order_relaxed); }
+
+/* The reaper timer is armed in one live thread's heap at a time. */
+QORBU_HIDDEN void arm_reaper_if_free(SelContext *ctx);
+QORBU_HIDDEN void release_reaper(SelContext *ctx);
+
+} // namespace qorbu::sel
+#endif
+
+#endif
