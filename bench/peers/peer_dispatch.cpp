@@ -164,14 +164,14 @@ int main(int argc, char **argv) {
 
     const char *what = "N pipes with A bytes circulating; each read callback reads one byte and writes one into the "
                        "next pipe; one operation = one callback with its read and write. Every loop is driven "
-                       "one pass at a time (`%s`). The floor is the same read+write pair with no loop at all. "
+                       "one pass at a time (%s). The floor is the same read+write pair with no loop at all. "
                        "Each sample creates its pipes and loop afresh, outside the timed part.";
     char what_sel[600], what_ep[600];
     snprintf(what_sel, sizeof what_sel, what,
-             "SelSelect`, `event_base_loop(EVLOOP_ONCE)` with the select backend, `ev_run(EVRUN_ONCE)` with "
-             "EVBACKEND_SELECT");
+             "`SelSelect`, `event_base_loop(EVLOOP_ONCE)` with the select backend, `ev_run(EVRUN_ONCE)` with "
+             "`EVBACKEND_SELECT`");
     snprintf(what_ep, sizeof what_ep, what,
-             "SelEpoll` after `SelUseEpoll`, libevent's epoll backend, libev's EVBACKEND_EPOLL, "
+             "`SelEpoll` after `SelUseEpoll`, libevent's epoll backend, libev's `EVBACKEND_EPOLL`, "
              "`uv_run(UV_RUN_ONCE)` with `uv_poll_t` watchers");
     Section sel{"dispatch_select", "Dispatch: select mode", what_sel, "pipes N, active A", "pipes N", true, {}, {}, {}};
     Section ep{"dispatch_epoll", "Dispatch: epoll mode", what_ep, "pipes N, active A", "pipes N", true, {}, {}, {}};
