@@ -32,6 +32,9 @@ enum ExitCode {
 
 enum { kSizeClasses = 27, kSmallestBlock = 8, kMaxNameLength = 250 };
 
+/* attach() found the segment busy and left the message to its caller. */
+enum { kBusyUnreported = -1 };
+
 static const char kUsage[] =
     "usage: qorbu-shm COMMAND [ARGUMENTS]\n"
     "\n"
@@ -163,12 +166,34 @@ static int range_is_free(uintptr_t start, size_t length)
     return probe == (void *)start; /* kernels before 4.17 take the flag as a hint */
 }
 
-static int attach(const char *name, int mode, ShmHandle **handle)
+static int busy_error(const char *name)
+{
+    return fail(EXIT_BUSY, "segment '%s' is busy: an allocation or free is running or was interrupted", name);
+}
+
+static void print_header_fields(const char *name, const Peek *peek)
+{
+    printf("name      %s\n", name);
+    printf("base      %#" PRIxPTR "\n", peek->base);
+    printf("data      %#" PRIxPTR "\n", peek->base + (uintptr_t)ShmOverhead());
+    printf("size      %" PRIu32 "\n", peek->size);
+    printf("useFlock  %" PRIu32 "\n", peek->useFlock);
+    printf("busy      %" PRIu32 "\n", peek->busy);
+}
+
+/* Read-only handles cannot take the segment's lock, so a busy segment is
+ * refused at once instead of being waited for; read-write attaches leave
+ * that decision to the library. */
+static int attach(const char *name, int mode, ShmHandle **handle, Peek *peekOut)
 {
     Peek peek;
     int status = peek_header(name, &peek);
     if (status != EXIT_OK)
         return status;
+    if (peekOut)
+        *peekOut = peek;
+    if (mode == O_RDONLY && peek.busy)
+        return peekOut ? kBusyUnreported : busy_error(name);
     if (!range_is_free(peek.base, peek.size))
         return fail(EXIT_FAILED, "cannot attach segment '%s': its range %#" PRIxPTR "..%#" PRIxPTR
                     " is in use in this process", name, peek.base, peek.base + peek.size);
@@ -178,7 +203,7 @@ static int attach(const char *name, int mode, ShmHandle **handle)
     if (errno == ENOENT)
         return fail(EXIT_NO_SEGMENT, "no segment named '%s'", name);
     if (errno == EBUSY)
-        return fail(EXIT_BUSY, "segment '%s' is busy: an allocation or free is running or was interrupted", name);
+        return busy_error(name);
     return fail(EXIT_FAILED, "cannot attach segment '%s': %s", name, error_text(errno));
 }
 
@@ -269,21 +294,21 @@ static int cmd_info(int argc, char **argv)
         return fail(EXIT_USAGE, "usage: qorbu-shm info NAME");
     int status = check_name(argv[0]);
     ShmHandle *handle = NULL;
+    Peek peek;
     if (status == EXIT_OK)
-        status = attach(argv[0], O_RDONLY, &handle);
+        status = attach(argv[0], O_RDONLY, &handle, &peek);
+    if (status == kBusyUnreported) {
+        /* The header is all there is to show of a busy segment. */
+        print_header_fields(argv[0], &peek);
+        return fail(EXIT_BUSY, "segment '%s' is busy: free lists not read", argv[0]);
+    }
     if (status != EXIT_OK)
         return status;
     const ShmHeader *header = header_of(handle);
-    printf("name      %s\n", argv[0]);
-    printf("base      %#" PRIxPTR "\n", header->base);
-    printf("data      %p\n", ShmAddr(handle));
-    printf("size      %" PRIu32 "\n", header->size);
-    printf("useFlock  %" PRIu32 "\n", header->useFlock);
-    printf("busy      %" PRIu32 "\n", header->busy);
+    peek = (Peek){header->base, header->size, header->useFlock, header->busy};
+    print_header_fields(argv[0], &peek);
     FreeStats stats;
-    if (header->busy) {
-        status = fail(EXIT_BUSY, "segment '%s' is busy: free lists not read", argv[0]);
-    } else if (walk_free_lists(header, &stats) != 0) {
+    if (walk_free_lists(header, &stats) != 0) {
         status = fail(EXIT_FAILED, "segment '%s' has a damaged free list", argv[0]);
     } else {
         printf("free      %" PRIu32 "\n", stats.freeBytes);
@@ -301,13 +326,13 @@ static int cmd_dump(int argc, char **argv)
     int status = check_name(argv[0]);
     ShmHandle *handle = NULL;
     if (status == EXIT_OK)
-        status = attach(argv[0], O_RDONLY, &handle);
+        status = attach(argv[0], O_RDONLY, &handle, NULL);
     if (status != EXIT_OK)
         return status;
     ShmHeader *header = header_of(handle);
     FreeStats stats;
     if (header->busy)
-        status = fail(EXIT_BUSY, "segment '%s' is busy: its free lists may be changing", argv[0]);
+        status = busy_error(argv[0]);
     else if (walk_free_lists(header, &stats) != 0)
         status = fail(EXIT_FAILED, "segment '%s' has a damaged free list", argv[0]);
     else
@@ -327,7 +352,7 @@ static int cmd_alloc(int argc, char **argv)
     if (parse_number(argv[1], 1, 0xffffffffu, &size) != 0)
         return fail(EXIT_USAGE, "invalid size '%s'", argv[1]);
     ShmHandle *handle = NULL;
-    status = attach(argv[0], O_RDWR, &handle);
+    status = attach(argv[0], O_RDWR, &handle, NULL);
     if (status != EXIT_OK)
         return status;
     void *block = ShmAlloc(handle, (uint32_t)size);
@@ -375,12 +400,12 @@ static int cmd_free(int argc, char **argv)
     if (parse_number(argv[1], 0, UINTPTR_MAX, &address) != 0)
         return fail(EXIT_USAGE, "invalid address '%s'", argv[1]);
     ShmHandle *handle = NULL;
-    status = attach(argv[0], O_RDWR, &handle);
+    status = attach(argv[0], O_RDWR, &handle, NULL);
     if (status != EXIT_OK)
         return status;
     ShmHeader *header = header_of(handle);
     if (header->busy)
-        status = fail(EXIT_BUSY, "segment '%s' is busy", argv[0]);
+        status = busy_error(argv[0]);
     else
         status = check_block(header, (uintptr_t)address, argv[1]);
     if (status == EXIT_OK)

@@ -163,11 +163,18 @@ protected:
     }
 };
 
-TEST_F(HostSchedLoopTest, PassRunsQueuedTasks)
+TEST_F(HostSchedLoopTest, PassRunsQueuedTasksBeforeItPolls)
 {
+    // A due timer keeps the pass from waiting: the queue must have been
+    // drained at its start, before the timers ended it.
+    SelTimer due{};
+    due.callback = [](SelTimer *) { return 0; };
+    SelMakeWhen(&due.when, 0, 0);
+    ASSERT_EQ(SelAddTimer(&due), 0);
     host_post(&host, record, (void *)"queued");
     EXPECT_EQ(SelSelect(), 0);
     EXPECT_EQ(ran, std::vector<std::string>{"queued"});
+    EXPECT_EQ(SelDebugIsTimerActive(&due), 0);
 }
 
 TEST_F(HostSchedLoopTest, TimedTaskEndsTheWaitWhenDue)
