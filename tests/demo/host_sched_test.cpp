@@ -142,6 +142,7 @@ TEST_F(HostSchedTest, WatchedDescriptorQueuesItsTaskWhileReadable)
     close(fds[1]);
 }
 
+#ifdef QORBU_DEMO_TEST_LOOP
 // The scheduler handed to the selector: one SelSelect pass runs what the
 // host queued, and a due timed task or a readable host descriptor ends the
 // pass's wait.
@@ -149,9 +150,6 @@ class HostSchedLoopTest : public HostSchedTest {
 protected:
     void SetUp() override
     {
-#ifndef QORBU_DEMO_TEST_LOOP
-        GTEST_SKIP() << "the select loop is not in this build yet";
-#endif
         HostSchedTest::SetUp();
         ASSERT_EQ(SelInit(), 0);
         SelSetZG(&host);
@@ -203,5 +201,6 @@ TEST_F(HostSchedLoopTest, ReadableHostDescriptorIsServicedAtTheEndOfThePass)
     close(fds[0]);
     close(fds[1]);
 }
+#endif
 
 } // namespace
