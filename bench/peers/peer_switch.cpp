@@ -6,6 +6,7 @@
 #include <ucontext.h>
 
 #include <memory>
+#include <signal.h>
 
 #include "greenthreads/greenthread.h"
 #include "harness.h"
@@ -97,6 +98,14 @@ long boost_create_finish(long ops) {
     return ops;
 }
 
+// --- floor: the signal-mask system call a switch that keeps the mask makes ---------
+long mask_calls(long ops, int per_op) {
+    sigset_t current;
+    sigprocmask(SIG_BLOCK, nullptr, &current);
+    for (long k = 0; k < ops * per_op; ++k) sigprocmask(SIG_SETMASK, &current, nullptr);
+    return ops;
+}
+
 } // namespace
 
 int main(int argc, char **argv) {
@@ -111,20 +120,30 @@ int main(int argc, char **argv) {
               "`greenthread_create` + `greenthreads_run` (the finished record and stack are reused); "
               "`makecontext` on a reused stack + `swapcontext` + return through `uc_link`; a Boost.Context "
               "fiber on a pooled stack resumed once. Bare `swapcontext` and libqorbu save and restore the "
-              "signal mask (one system call per switch); Boost.Context does not.",
+              "signal mask (one system call per switch); Boost.Context does not. The floor is that system call "
+              "alone: one `sigprocmask` per switch, two per create+finish (two switches).",
               "operation", "", false,
-              {{"libqorbu", Role::Ours}, {"swapcontext", Role::Peer}, {"Boost.Context", Role::Peer}}, {}, {}};
+              {{"libqorbu", Role::Ours},
+               {"swapcontext", Role::Peer},
+               {"Boost.Context", Role::Peer},
+               {"sigprocmask", Role::Floor}},
+              {},
+              {}};
 
     Timed q_sw(o, qorbu_switches), u_sw(o, uc_switches), b_sw(o, boost_switches);
+    Timed f_sw(o, [](long ops) { return mask_calls(ops, 1); });
     std::vector<Contender> sw = {{"libqorbu", Role::Ours, [&] { return q_sw(); }},
                                  {"swapcontext", Role::Peer, [&] { return u_sw(); }},
-                                 {"Boost.Context", Role::Peer, [&] { return b_sw(); }}};
+                                 {"Boost.Context", Role::Peer, [&] { return b_sw(); }},
+                                 {"sigprocmask", Role::Floor, [&] { return f_sw(); }}};
     s.add("switch", NAN, "", interleave(o, sw));
 
     Timed q_cf(o, qorbu_create_finish), u_cf(o, uc_create_finish), b_cf(o, boost_create_finish);
+    Timed f_cf(o, [](long ops) { return mask_calls(ops, 2); });
     std::vector<Contender> cf = {{"libqorbu", Role::Ours, [&] { return q_cf(); }},
                                  {"swapcontext", Role::Peer, [&] { return u_cf(); }},
-                                 {"Boost.Context", Role::Peer, [&] { return b_cf(); }}};
+                                 {"Boost.Context", Role::Peer, [&] { return b_cf(); }},
+                                 {"sigprocmask", Role::Floor, [&] { return f_cf(); }}};
     s.add("create+finish", NAN, "", interleave(o, cf));
 
     s.verdicts.push_back(check(s, "a green-thread switch at most 1.1x a bare swapcontext", "libqorbu",

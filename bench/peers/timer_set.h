@@ -2,6 +2,7 @@
 // libevent and libev live in separate files: their headers clash.
 #pragma once
 
+#include <stdint.h>
 #include <time.h>
 #include <unistd.h>
 
@@ -38,9 +39,19 @@ struct TimerSet {
     long n = 0;
     bool far_armed = false;
 
-    // index n is the extra timer of arm+cancel
+    std::vector<long> order;
+
+    // Records are armed in a random order (the same for every library), so
+    // that no library finds its timers in memory order when they fire; libuv
+    // would otherwise (it breaks its millisecond ties by arming order).
+    // Index n is the extra timer of arm+cancel.
     void arm_all(bool far, Rng &r) {
-        for (long i = 0; i < n; ++i) arm(i, far ? far_us(r) : near_us(r));
+        if (order.empty()) {
+            Rng shuffle{uint64_t(n)};
+            for (long i = 0; i < n; ++i) order.push_back(i);
+            for (long i = n - 1; i > 0; --i) std::swap(order[size_t(i)], order[shuffle.next() % uint64_t(i + 1)]);
+        }
+        for (long i : order) arm(i, far ? far_us(r) : near_us(r));
     }
     void cancel_all() {
         for (long i = 0; i < n; ++i) cancel(i);
