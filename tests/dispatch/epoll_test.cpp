@@ -98,6 +98,7 @@ TEST_F(EpollInstance, InstanceIsNeverStoredAsDescriptorZero) {
 }
 
 TEST_F(EpollInstance, ConcurrentSwitchesCreateOneInstance) {
+    SKIP_IF_NO_FORK_OR_THREADS();
     constexpr int kThreads = 6;
     std::atomic<int> ready{0};
     std::vector<int> seen(kThreads, -1);
@@ -220,6 +221,7 @@ TEST_F(Epoll, NothingReadyAndNoTimerReturnsAtOnce) {
 }
 
 TEST_F(Epoll, RegisteredSignalDuringTheWaitInterruptsThePass) {
+    SKIP_IF_NO_FORK_OR_THREADS();
     struct sigaction sa {};
     sa.sa_handler = count_signal;
     ASSERT_EQ(sigaction(SIGUSR1, &sa, nullptr), 0);
@@ -266,6 +268,7 @@ TEST_F(Epoll, BlockingWaitTimeoutIsTruncatedToMilliseconds) {
 }
 
 TEST_F(Epoll, ForeignDescriptorInPlaceOfTheInstanceAborts) {
+    SKIP_IF_NO_FORK_OR_THREADS();
     Pipe p;
     ASSERT_EQ(dup2(p.r, GetEpollFd()), GetEpollFd());
     EXPECT_DEATH(SelEpoll(), "Epoll failed: Invalid argument");

@@ -390,6 +390,7 @@ TEST_F(SelectSignals, RegisteredSignalIsDeliveredOnlyDuringTheBlockingWait) {
 /* --- wait failures --------------------------------------------------------- */
 
 TEST_F(SelectFailures, ClosedDescriptorIsNamedWithItsCallbackThenAborts) {
+    SKIP_IF_NO_FORK_OR_THREADS();
     Pipe registered(40), hostOnly(50), healthy(42);
     ASSERT_EQ(SelAddFD(registered.r, SEL_READ, 0, log_callback, nullptr), 0);
     ASSERT_EQ(SelAddFD(healthy.r, SEL_READ, 0, log_callback, nullptr), 0);
@@ -433,6 +434,7 @@ TEST_F(SelectFailures, EinvalWaitsReturnWithDiagnosticUntilTheFifthAborts) {
         EXPECT_EQ(std::count(err.begin(), err.end(), '\n'), 2 + 64);
     }
     EXPECT_EQ(scripted::host().counts.snmpTimeout, 0);
+    SKIP_IF_NO_FORK_OR_THREADS();
     EXPECT_DEATH(SelSelect(), literal_regex("SelSelect(): [p]select() failed: Invalid argument\n"));
 }
 
