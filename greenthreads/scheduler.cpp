@@ -308,7 +308,9 @@ void greenthread_block(void)
 
 void greenthread_wakeup(Greenthread *thread)
 {
-    if (thread->runnable != 0)
+    /* Null is what a selector callback holds when it was armed before
+     * greenthreads_init: there is no thread to wake. */
+    if (thread == nullptr || thread->runnable != 0)
         return;
     thread->runnable = 1;
     run_queue_append(thread);
