@@ -114,6 +114,9 @@ inline void yield_times(int n)
         greenthread_yield();
 }
 
+/* Sleeps in the selector: a wait on no event ends with its time-out. */
+inline void sleep_ms(int ms) { nb_poll(-1, 0, ms); }
+
 /* Ensures descriptors up to `needed` can be opened; false when the hard
  * limit forbids it. */
 inline bool raise_fd_limit(rlim_t needed)
