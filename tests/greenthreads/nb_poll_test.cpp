@@ -51,13 +51,15 @@ TEST_F(NbPoll, TimeoutIsArmedOnTheMonotonicClockAndReadinessEndsTheWait)
     };
     double deadline = 0;
     unsigned events = 0;
-    NbWait *wait = nullptr;
+    Greenthread *waitingThread = nullptr;
+    bool timerArmed = false;
     auto inspector = [&] {
         // Runs once the waiter has blocked.
         SelTimer *timer = find_wait_timer();
         if (timer != nullptr) {
             deadline = static_cast<double>(timer->when.tv_sec) + static_cast<double>(timer->when.tv_nsec) / 1e9;
-            wait = static_cast<NbWait *>(timer->arg);
+            timerArmed = true;
+            waitingThread = static_cast<NbWait *>(timer->arg)->thread;
         }
         events = registered_events(pair.fd[0]);
         (void)write(pair.fd[1], "x", 1);
@@ -65,8 +67,8 @@ TEST_F(NbPoll, TimeoutIsArmedOnTheMonotonicClockAndReadinessEndsTheWait)
     waiterThread = spawn(&waiter);
     spawn(&inspector);
     greenthreads_run();
-    ASSERT_NE(wait, nullptr) << "no time-out timer was armed";
-    EXPECT_EQ(wait->thread, waiterThread);
+    ASSERT_TRUE(timerArmed) << "no time-out timer was armed";
+    EXPECT_EQ(waitingThread, waiterThread);
     EXPECT_GE(deadline - start, 1.5);
     EXPECT_LT(deadline - start, 2.5);
     EXPECT_EQ(events, SEL_READ) << "POLLPRI is not watched";

@@ -116,8 +116,7 @@ TEST_F(Scheduler, FinishedRecordIsReusedWithItsStackAndStartsAfresh)
     static int runs;
     runs = 0;
     auto markStack = [](void *arg) {
-        char local;
-        stackMark = &local;
+        stackMark = __builtin_frame_address(0);
         *static_cast<int *>(arg) += 1;
         ++runs;
     };
