@@ -7,6 +7,7 @@
 #include <string.h>
 #include <sys/time.h>
 
+#include <algorithm>
 #include <vector>
 
 #include "nb_test_support.h"
@@ -115,7 +116,7 @@ TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
     };
     auto reader = [&] {
         while (received < total) {
-            const int n = nb_read(pair.fd[0], in.data() + received, 4096);
+            const int n = nb_read(pair.fd[0], in.data() + received, std::min<size_t>(4096, total - received));
             if (n <= 0)
                 break;
             received += static_cast<size_t>(n);

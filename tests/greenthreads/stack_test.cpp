@@ -120,6 +120,7 @@ TEST_F(Stack, DeepButBoundedUseOfTheStackIsFine)
     EXPECT_EQ(reached, 1 + static_cast<char>(512));
 }
 
+#if defined(__SANITIZE_ADDRESS__)
 __attribute__((noinline)) void overflow_a_local(void *)
 {
     char buffer[16];
@@ -127,6 +128,7 @@ __attribute__((noinline)) void overflow_a_local(void *)
     volatile int index = 16;
     bytes[index] = 1;
 }
+#endif
 
 TEST_F(Stack, AddressSanitizerReportsFaultsOnGreenThreadStacks)
 {
