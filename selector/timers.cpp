@@ -85,6 +85,19 @@ void remove_timer(SelContext *ctx, SelTimer *t) {
         SelHeapDown(ctx, i);
 }
 
+// A sift-down in a large heap waits on the records of both children at every
+// level; asking for the next level's four records one level ahead overlaps
+// those cache misses. Changes nothing but timing.
+constexpr uint32_t kGrandchildren = 4;
+
+inline void prefetch_grandchildren(SelTimer *const *heap, uint32_t left, uint32_t count) {
+    const uint32_t first = 2 * left;
+    if (first + kGrandchildren - 1 > count)
+        return;
+    for (uint32_t g = first; g < first + kGrandchildren; ++g)
+        __builtin_prefetch(&heap[g]->when);
+}
+
 bool is_due(const SelTimer *t, const struct timespec &now) { return !SelTimerBefore(&now, &t->when); }
 
 } // namespace
@@ -116,6 +129,7 @@ void SelHeapDown(SelContext *ctx, uint32_t slot) {
         uint32_t left = 2 * slot;
         if (left > count)
             break;
+        prefetch_grandchildren(heap, left, count);
         uint32_t right = left + 1;
         uint32_t child = left;
         // On equal deadlines the right child goes up.
