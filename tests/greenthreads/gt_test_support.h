@@ -49,6 +49,12 @@ inline MappingAt mapping_at(const void *addr)
     return found;
 }
 
+/* qemu-user leaves inaccessible guest pages out of its /proc/self/maps. */
+inline bool is_inaccessible(const MappingAt &mapping, bool emulated)
+{
+    return mapping.perms == "---p" || (emulated && mapping.perms.empty());
+}
+
 } // namespace qorbu::test
 
 /* A fault that must end the process with SIGSEGV. */
