@@ -26,6 +26,17 @@ void wait_for_result(const NbWait &wait)
         greenthread_block();
 }
 
+/* In epoll mode the registry may keep the entry when epoll itself refuses
+ * the descriptor; an entry that points at this wait must not outlive it.
+ * Someone else's registration is left alone. */
+void forget_refused_registration(int fd, NbWait &wait)
+{
+    const int saved = errno;
+    if (fd >= 0 && SelGetFDArg(fd) == &wait)
+        SelRemFD(fd);
+    errno = saved;
+}
+
 int arm_timeout(SelTimer &timer, NbWait &wait, int timeout)
 {
     timer.heapIndex = 0;
@@ -80,8 +91,10 @@ extern "C" int nb_poll(int fd, int events, int timeout)
     }
     /* A descriptor the selector refuses (invalid, out of its range, already
      * registered) could never wake us: fail at once with its errno. */
-    if (watchDescriptor && SelAddFD(fd, mask, 0, nb_poll_on_ready, &wait) != 0)
+    if (watchDescriptor && SelAddFD(fd, mask, 0, nb_poll_on_ready, &wait) != 0) {
+        nb::forget_refused_registration(fd, wait);
         return -1;
+    }
     SelTimer timer = {};
     if (timeout > 0 && nb::arm_timeout(timer, wait, timeout) != 0) {
         const int saved = errno;

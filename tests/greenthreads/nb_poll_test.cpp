@@ -244,6 +244,26 @@ TEST_F(NbPoll, DescriptorBeyondTheSelectRangeFailsInSelectMode)
     close(high);
 }
 
+TEST_F(NbPoll, InEpollModeADescriptorEpollRefusesFailsAndLeavesNoEntry)
+{
+    if (!raise_fd_limit(FD_SETSIZE + 16))
+        GTEST_SKIP() << "RLIMIT_NOFILE's hard limit is below " << FD_SETSIZE + 16;
+    ASSERT_EQ(SelUseEpoll(), 0);
+    const int closed = FD_SETSIZE + 9; // not open
+    ASSERT_EQ(fcntl(closed, F_GETFD), -1);
+    int result = 0, error = 0;
+    auto waiter = [&] {
+        result = nb_poll(closed, POLLIN, 0);
+        error = errno;
+    };
+    spawn(&waiter);
+    greenthreads_run();
+    EXPECT_EQ(result, -1);
+    EXPECT_NE(error, 0);
+    EXPECT_EQ(registered_events(closed), 0u) << "a refused wait left its entry behind";
+    DeInitEpoll();
+}
+
 // ---------------------------------------------------------------------------
 // The main context may not block: there nb_poll drives the run loop itself.
 
