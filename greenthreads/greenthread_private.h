@@ -69,7 +69,7 @@ QORBU_HIDDEN extern long page_size;
 QORBU_HIDDEN extern int live_threads;
 
 QORBU_HIDDEN void run_queue_append(Greenthread *thread);
-QORBU_HIDDEN void greenthread_start();
+[[noreturn]] QORBU_HIDDEN void greenthread_start();
 
 /* One turn of the run loop: hand the processor to the queued threads if
  * there are any, otherwise wait once in the selector. */

@@ -233,9 +233,13 @@ void greenthread_start()
     free_threads = self;
     --live_threads;
     /* Nothing wakes a finished record; the next greenthread_create restarts
-     * its context from the top, so this frame is simply abandoned. */
-    self->runnable = 0;
-    switch_to_next(true);
+     * its context from the top, so this frame is simply abandoned. Falling
+     * off the end would end the whole process (the context has no link),
+     * so a switch that failed is tried again. */
+    for (;;) {
+        self->runnable = 0;
+        switch_to_next(true);
+    }
 }
 
 void run_one_turn()
