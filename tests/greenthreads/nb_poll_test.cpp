@@ -123,20 +123,6 @@ TEST_F(NbPoll, CallbacksGiveReadinessPrecedenceInEitherOrder)
     EXPECT_EQ(wait.result, 1) << "a later time-out changes nothing";
 }
 
-TEST_F(NbPoll, CallbacksWakeTheWaitingThreadOnce)
-{
-    Greenthread *blocked = greenthread_create([](void *) { greenthread_block(); }, nullptr);
-    greenthread_yield(); // the thread blocks
-    ASSERT_EQ(blocked->runnable, 0);
-    NbWait wait = {blocked, 0};
-    nb_poll_on_ready(0, SEL_READ, &wait, nullptr);
-    nb_poll_on_ready(0, SEL_WRITE, &wait, nullptr);
-    EXPECT_EQ(blocked->runnable, 1);
-    EXPECT_EQ(run_queue_head, blocked);
-    EXPECT_EQ(run_queue_tail, blocked);
-    greenthreads_run();
-}
-
 TEST_F(NbPoll, WithoutTimeoutItWaitsWhileOtherThreadsRun)
 {
     SocketPair pair;

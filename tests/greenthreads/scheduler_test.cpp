@@ -49,16 +49,6 @@ protected:
     }
 };
 
-TEST_F(Scheduler, InitMakesTheMainContextRunningAndUncounted)
-{
-    Greenthread *self = current_greenthread();
-    EXPECT_EQ(self, main_thread);
-    EXPECT_EQ(self->runnable, 1);
-    EXPECT_EQ(live_threads, 0);
-    EXPECT_EQ(run_queue_head, nullptr);
-    EXPECT_GT(page_size, 0);
-}
-
 TEST_F(Scheduler, QueueIsFifoAndTheMainContextTakesOneTurnPerPass)
 {
     Yielder a{'A', 3}, b{'B', 3};
@@ -91,15 +81,6 @@ TEST_F(Scheduler, NewThreadWaitsForItsCreatorAndGetsItsArgument)
     EXPECT_TRUE(ran);
     EXPECT_EQ(received, &token);
     EXPECT_EQ(live_threads, 0);
-}
-
-TEST_F(Scheduler, CurrentGreenthreadNamesTheRunningRecord)
-{
-    static Greenthread *seen;
-    Greenthread *created = greenthread_create([](void *) { seen = current_greenthread(); }, nullptr);
-    greenthreads_run();
-    EXPECT_EQ(seen, created);
-    EXPECT_EQ(current_greenthread(), main_thread);
 }
 
 TEST_F(Scheduler, YieldWithNothingElseQueuedReturnsAtOnce)

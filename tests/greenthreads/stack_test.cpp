@@ -60,20 +60,6 @@ TEST_F(Stack, MappingIsGuardedWritableAndNotExecutable)
     EXPECT_EQ(mapping_at(stackBase + stackLength - 1).perms, "rw-p");
 }
 
-TEST_F(Stack, EveryNewThreadGetsItsOwnMapping)
-{
-    static char *bases[2];
-    static int n;
-    n = 0;
-    auto record = [](void *) { bases[n++] = static_cast<char *>(current_greenthread()->context.uc_stack.ss_sp); };
-    greenthread_create(record, nullptr);
-    greenthread_create(record, nullptr);
-    greenthreads_run();
-    ASSERT_EQ(n, 2);
-    const size_t length = stack_mapping_length(page_size);
-    EXPECT_TRUE(bases[0] + length <= bases[1] || bases[1] + length <= bases[0]);
-}
-
 void touch_guard_page(void *)
 {
     volatile char *guard = static_cast<char *>(current_greenthread()->context.uc_stack.ss_sp);
@@ -103,21 +89,6 @@ TEST_F(Stack, OverflowHitsTheGuardPageAndEndsWithSigsegv)
         greenthread_create([](void *) { recurse(0); }, nullptr);
         greenthreads_run();
     });
-}
-
-TEST_F(Stack, DeepButBoundedUseOfTheStackIsFine)
-{
-    static int reached;
-    greenthread_create(
-        [](void *) {
-            volatile char buffer[8 * 1024];
-            for (size_t i = 0; i < sizeof buffer; i += 512)
-                buffer[i] = static_cast<char>(i);
-            reached = buffer[512] + 1;
-        },
-        nullptr);
-    greenthreads_run();
-    EXPECT_EQ(reached, 1 + static_cast<char>(512));
 }
 
 #if defined(__SANITIZE_ADDRESS__)
