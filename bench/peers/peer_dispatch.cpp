@@ -184,9 +184,12 @@ int main(int argc, char **argv) {
         for (int n : {100, 1000}) {
             std::vector<Contender> cs;
             std::vector<std::shared_ptr<DispatchContender>> dc;
+            std::string label = "N=" + std::to_string(n) + ", A=" + std::to_string(a);
             for (auto &e : entries) {
                 auto d = std::make_shared<DispatchContender>(DispatchContender{n, a, e.make, &o});
-                cs.push_back({e.name, e.role, [d] { return (*d)(); }});
+                // e.g. "libqorbu/select N=100, A=1", for --only
+                std::string key = std::string(e.name) + (e.section == 0 ? "/select " : e.section == 1 ? "/epoll " : " ") + label;
+                cs.push_back({key, e.role, [d] { return (*d)(); }});
             }
             std::vector<double> med = interleave(o, cs);
             std::vector<double> ms, me;
@@ -194,7 +197,6 @@ int main(int argc, char **argv) {
                 if (entries[i].section != 1) ms.push_back(med[i]);
                 if (entries[i].section != 0) me.push_back(med[i]);
             }
-            std::string label = "N=" + std::to_string(n) + ", A=" + std::to_string(a);
             std::string series = "A=" + std::to_string(a);
             sel.add(label, n, series, ms);
             ep.add(label, n, series, me);
