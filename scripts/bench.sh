@@ -6,9 +6,9 @@
 #   bash scripts/bench.sh --quick    smoke run: fewer repetitions, smaller sizes;
 #                                    writes to build/bench/results only
 #
-# Needs: cmake, ninja, g++, gnuplot (gnuplot-nox), Google Benchmark
-# (libbenchmark-dev) and the peers: libevent-dev libev-dev libuv1-dev
-# libboost-dev libboost-context-dev.
+# Needs cmake, ninja and g++; installs what else is missing with apt-get:
+# gnuplot-nox, libbenchmark-dev and the peers libevent-dev libev-dev
+# libuv1-dev libboost-dev libboost-context-dev.
 set -euo pipefail
 
 root=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
@@ -22,8 +22,11 @@ for pkg in libevent-dev libev-dev libuv1-dev libboost-dev libboost-context-dev l
   dpkg-query -W -f='${Status}' "$pkg" 2>/dev/null | grep -q 'ok installed' || missing+=("$pkg")
 done
 if ((${#missing[@]})); then
-  echo "bench.sh: missing packages: ${missing[*]} (apt-get install ${missing[*]})" >&2
-  exit 1
+  echo "bench.sh: installing ${missing[*]}" >&2
+  apt-get install -y -q "${missing[@]}" >/dev/null || {
+    echo "bench.sh: cannot install ${missing[*]} (run apt-get update, or install them as root)" >&2
+    exit 1
+  }
 fi
 
 start=$(date +%s)

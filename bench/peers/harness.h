@@ -43,6 +43,7 @@ struct Options {
     double sample_ms = 20;        // target duration of one timed sample
     double scale = 1.0;           // <1 for a quick smoke run
     std::string out_dir = ".";    // where fragments, data and plot scripts go
+    std::string only;             // run only contenders whose name contains this (profiling)
 
     static Options parse(int argc, char **argv) {
         Options o;
@@ -56,9 +57,10 @@ struct Options {
             else if (const char *v = value("--sample-ms=")) o.sample_ms = atof(v);
             else if (const char *v = value("--scale=")) o.scale = atof(v);
             else if (const char *v = value("--out=")) o.out_dir = v;
+            else if (const char *v = value("--only=")) o.only = v;
             else if (const char *v = value("--clock=")) sample_clock() = strcmp(v, "wall") == 0 ? CLOCK_MONOTONIC : CLOCK_THREAD_CPUTIME_ID;
             else {
-                fprintf(stderr, "usage: %s [--reps=N] [--sample-ms=MS] [--scale=F] [--out=DIR] [--clock=cpu|wall]\n", argv[0]);
+                fprintf(stderr, "usage: %s [--reps=N] [--sample-ms=MS] [--scale=F] [--out=DIR] [--clock=cpu|wall] [--only=NAME]\n", argv[0]);
                 exit(2);
             }
         }
@@ -91,6 +93,7 @@ inline std::vector<double> interleave(const Options &o, std::vector<Contender> &
     for (int r = 0; r < o.reps; ++r)
         for (size_t k = 0; k < cs.size(); ++k) {
             size_t i = (k + size_t(r)) % cs.size();
+            if (!o.only.empty() && cs[i].name.find(o.only) == std::string::npos) continue;
             samples[i].push_back(cs[i].run());
         }
     std::vector<double> med;

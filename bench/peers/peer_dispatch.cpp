@@ -164,14 +164,14 @@ int main(int argc, char **argv) {
 
     const char *what = "N pipes with A bytes circulating; each read callback reads one byte and writes one into the "
                        "next pipe; one operation = one callback with its read and write. Every loop is driven "
-                       "one pass at a time (`%s`). The floor is the same read+write pair with no loop at all. "
+                       "one pass at a time (%s). The floor is the same read+write pair with no loop at all. "
                        "Each sample creates its pipes and loop afresh, outside the timed part.";
     char what_sel[600], what_ep[600];
     snprintf(what_sel, sizeof what_sel, what,
-             "SelSelect`, `event_base_loop(EVLOOP_ONCE)` with the select backend, `ev_run(EVRUN_ONCE)` with "
-             "EVBACKEND_SELECT");
+             "`SelSelect`, `event_base_loop(EVLOOP_ONCE)` with the select backend, `ev_run(EVRUN_ONCE)` with "
+             "`EVBACKEND_SELECT`");
     snprintf(what_ep, sizeof what_ep, what,
-             "SelEpoll` after `SelUseEpoll`, libevent's epoll backend, libev's EVBACKEND_EPOLL, "
+             "`SelEpoll` after `SelUseEpoll`, libevent's epoll backend, libev's `EVBACKEND_EPOLL`, "
              "`uv_run(UV_RUN_ONCE)` with `uv_poll_t` watchers");
     Section sel{"dispatch_select", "Dispatch: select mode", what_sel, "pipes N, active A", "pipes N", true, {}, {}, {}};
     Section ep{"dispatch_epoll", "Dispatch: epoll mode", what_ep, "pipes N, active A", "pipes N", true, {}, {}, {}};
@@ -184,9 +184,12 @@ int main(int argc, char **argv) {
         for (int n : {100, 1000}) {
             std::vector<Contender> cs;
             std::vector<std::shared_ptr<DispatchContender>> dc;
+            std::string label = "N=" + std::to_string(n) + ", A=" + std::to_string(a);
             for (auto &e : entries) {
                 auto d = std::make_shared<DispatchContender>(DispatchContender{n, a, e.make, &o});
-                cs.push_back({e.name, e.role, [d] { return (*d)(); }});
+                // e.g. "libqorbu/select N=100, A=1", for --only
+                std::string key = std::string(e.name) + (e.section == 0 ? "/select " : e.section == 1 ? "/epoll " : " ") + label;
+                cs.push_back({key, e.role, [d] { return (*d)(); }});
             }
             std::vector<double> med = interleave(o, cs);
             std::vector<double> ms, me;
@@ -194,7 +197,6 @@ int main(int argc, char **argv) {
                 if (entries[i].section != 1) ms.push_back(med[i]);
                 if (entries[i].section != 0) me.push_back(med[i]);
             }
-            std::string label = "N=" + std::to_string(n) + ", A=" + std::to_string(a);
             std::string series = "A=" + std::to_string(a);
             sel.add(label, n, series, ms);
             ep.add(label, n, series, me);
