@@ -454,6 +454,24 @@ TEST_F(SelectFailures, EinvalWaitsReturnWithDiagnosticUntilTheFifthAborts) {
     EXPECT_DEATH(SelSelect(), literal_regex("SelSelect(): [p]select() failed: Invalid argument\n"));
 }
 
+TEST_F(SelectFailures, EinvalCountIsSharedByAllThreads) {
+    SKIP_IF_NO_FORK_OR_THREADS();
+    scripted::host().snmp.giveTimeout = true;
+    scripted::host().snmp.timeout = {0, 1500000};
+    qorbu::sel::sel_einval_count.store(0);
+    constexpr int kThreads = 3, kFailuresEach = 1;
+    testing::internal::CaptureStderr();
+    std::vector<std::thread> threads;
+    for (int i = 0; i < kThreads; ++i)
+        threads.emplace_back([] {
+            ASSERT_EQ(SelInit(), 0);
+            for (int f = 0; f < kFailuresEach; ++f) EXPECT_EQ(SelSelect(), -1);
+        });
+    for (auto &t : threads) t.join();
+    testing::internal::GetCapturedStderr();
+    EXPECT_EQ(qorbu::sel::sel_einval_count.load(), kThreads * kFailuresEach);
+}
+
 TEST_F(SelectFailures, ScanWithReadyPairsLeftResetsTheEinvalCount) {
     scripted::host().snmp.giveTimeout = true;
     scripted::host().snmp.timeout = {0, 1500000};
