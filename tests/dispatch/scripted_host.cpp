@@ -1,11 +1,15 @@
 #include "scripted_host.h"
 
 #include <cstring>
+#include <mutex>
 
 namespace scripted {
 namespace {
 constexpr unsigned kTaskMagic = 0x7a61736bu;
 Host *g_host = nullptr;
+/* Passes of several threads may call the host at once; a task run by
+ * thread_call may itself run a pass, hence recursive. */
+std::recursive_mutex g_lock;
 
 bool set_is_empty(const fd_set *set) {
     for (int fd = 0; fd < FD_SETSIZE; ++fd)
@@ -42,7 +46,12 @@ void set_timed(int list, struct timeval when) {
 
 void queue_task(int id, std::function<void()> run) { host().queue.push_back(Task{id, std::move(run)}); }
 
-void log(const std::string &entry) { host().log.push_back(entry); }
+void log(const std::string &entry) {
+    std::lock_guard<std::recursive_mutex> guard(g_lock);
+    host().log.push_back(entry);
+}
+
+std::recursive_mutex &lock() { return g_lock; }
 
 } // namespace scripted
 
@@ -51,6 +60,7 @@ using scripted::host;
 extern "C" {
 
 int thread_fetch_queued(void *hostContext, void *task) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     scripted::Host &h = host();
     ++h.counts.fetch;
     if (hostContext != &h.context) scripted::log("fetch:foreign-context");
@@ -68,6 +78,7 @@ int thread_fetch_queued(void *hostContext, void *task) {
 }
 
 int thread_call(void *task) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     scripted::Host &h = host();
     ++h.counts.call;
     scripted::TaskRecord record;
@@ -82,6 +93,7 @@ int thread_call(void *task) {
 }
 
 int thread_select_nb(void *) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     ++host().counts.selectNb;
     scripted::log("select_nb");
     if (host().onSelectNb) host().onSelectNb();
@@ -89,6 +101,7 @@ int thread_select_nb(void *) {
 }
 
 int timeval_cmp(struct timeval a, struct timeval b) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     ++host().counts.cmp;
     if (a.tv_sec != b.tv_sec) return a.tv_sec < b.tv_sec ? -1 : 1;
     if (a.tv_usec != b.tv_usec) return a.tv_usec < b.tv_usec ? -1 : 1;
@@ -96,6 +109,7 @@ int timeval_cmp(struct timeval a, struct timeval b) {
 }
 
 struct timeval timeval_sub(struct timeval a, struct timeval b) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     ++host().counts.sub;
     host().subArgs.push_back(a);
     struct timeval d = {a.tv_sec - b.tv_sec, a.tv_usec - b.tv_usec};
@@ -107,6 +121,7 @@ struct timeval timeval_sub(struct timeval a, struct timeval b) {
 }
 
 int pal_time_tzcurrent(struct timeval *now, void *unused) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     ++host().counts.tzcurrent;
     scripted::log("tzcurrent");
     if (unused) scripted::log("tzcurrent:non-null");
@@ -115,6 +130,7 @@ int pal_time_tzcurrent(struct timeval *now, void *unused) {
 }
 
 int snmp_select_info(int *numfds, fd_set *fdset, struct timeval *timeout, int *block) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     scripted::Host &h = host();
     ++h.counts.snmpInfo;
     scripted::log("snmp_info");
@@ -130,6 +146,7 @@ int snmp_select_info(int *numfds, fd_set *fdset, struct timeval *timeout, int *b
 }
 
 void snmp_read(fd_set *fdset) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     scripted::Host &h = host();
     ++h.counts.snmpRead;
     scripted::log("snmp_read");
@@ -138,12 +155,14 @@ void snmp_read(fd_set *fdset) {
 }
 
 void snmp_timeout(void) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     ++host().counts.snmpTimeout;
     scripted::log("snmp_timeout");
     if (host().snmp.onTimeout) host().snmp.onTimeout();
 }
 
 void run_alarms(void) {
+    std::lock_guard<std::recursive_mutex> guard(scripted::lock());
     ++host().counts.runAlarms;
     scripted::log("run_alarms");
 }

@@ -10,6 +10,7 @@
 
 #include <deque>
 #include <functional>
+#include <mutex>
 #include <string>
 #include <vector>
 
@@ -70,6 +71,8 @@ void reset();
 void set_timed(int list, struct timeval when);
 void queue_task(int id, std::function<void()> run = {});
 void log(const std::string &entry);
+/* Held by every host function while it runs. */
+std::recursive_mutex &lock();
 
 } // namespace scripted
 

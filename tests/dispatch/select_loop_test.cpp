@@ -10,6 +10,7 @@
 #include <cerrno>
 #include <cstdio>
 #include <string>
+#include <thread>
 
 #include "dispatch_fixture.h"
 #include "selector/dispatch_private.h"
@@ -175,6 +176,21 @@ TEST_F(SelectPass, NegativeSnmpTimeoutIsReportedZeroedAndServiced) {
     EXPECT_LT(seconds_since(start), kGenerousLimit);
     EXPECT_EQ(scripted::host().counts.snmpTimeout, 1);
     EXPECT_EQ(scripted::host().counts.runAlarms, 1);
+}
+
+TEST_F(SelectPass, WithoutAnyTimeoutSourceTheWaitLastsUntilADescriptorIsReady) {
+    SKIP_IF_NO_FORK_OR_THREADS();
+    ASSERT_EQ(SelRemoveAllTimers(), 1); /* the reaper's */
+    Pipe p(40);
+    ASSERT_EQ(SelAddFD(p.r, SEL_READ, 0, log_callback, nullptr), 0);
+    std::thread writer([&p] {
+        std::this_thread::sleep_for(std::chrono::milliseconds(200));
+        p.fill();
+    });
+    EXPECT_EQ(SelSelect(), 0);
+    writer.join();
+    EXPECT_EQ(callbacks_logged(), (Log{cb(40, "r")})) << "the wait ended before the descriptor was ready";
+    EXPECT_EQ(scripted::host().counts.snmpTimeout, 0);
 }
 
 TEST_F(SelectPass, HostHooksStayOffWithoutHostContextOrScheduler) {
@@ -380,10 +396,10 @@ TEST_F(SelectSignals, RegisteredSignalIsDeliveredOnlyDuringTheBlockingWait) {
     errno = 0;
     EXPECT_EQ(SelSelect(), -1);
     EXPECT_EQ(errno, EINTR);
+    sigset_t now;
+    sigprocmask(SIG_BLOCK, nullptr, &now); /* ThreadSanitizer runs deferred handlers here */
     EXPECT_EQ(g_handled, 1);
     EXPECT_EQ(scripted::host().counts.selectNb, servicedBefore) << "no servicing after an interrupted wait";
-    sigset_t now;
-    sigprocmask(SIG_BLOCK, nullptr, &now);
     EXPECT_EQ(sigismember(&now, SIGUSR1), 1) << "blocked again after the wait";
 }
 
@@ -436,6 +452,24 @@ TEST_F(SelectFailures, EinvalWaitsReturnWithDiagnosticUntilTheFifthAborts) {
     EXPECT_EQ(scripted::host().counts.snmpTimeout, 0);
     SKIP_IF_NO_FORK_OR_THREADS();
     EXPECT_DEATH(SelSelect(), literal_regex("SelSelect(): [p]select() failed: Invalid argument\n"));
+}
+
+TEST_F(SelectFailures, EinvalCountIsSharedByAllThreads) {
+    SKIP_IF_NO_FORK_OR_THREADS();
+    scripted::host().snmp.giveTimeout = true;
+    scripted::host().snmp.timeout = {0, 1500000};
+    qorbu::sel::sel_einval_count.store(0);
+    constexpr int kThreads = 3, kFailuresEach = 1;
+    testing::internal::CaptureStderr();
+    std::vector<std::thread> threads;
+    for (int i = 0; i < kThreads; ++i)
+        threads.emplace_back([] {
+            ASSERT_EQ(SelInit(), 0);
+            for (int f = 0; f < kFailuresEach; ++f) EXPECT_EQ(SelSelect(), -1);
+        });
+    for (auto &t : threads) t.join();
+    testing::internal::GetCapturedStderr();
+    EXPECT_EQ(qorbu::sel::sel_einval_count.load(), kThreads * kFailuresEach);
 }
 
 TEST_F(SelectFailures, ScanWithReadyPairsLeftResetsTheEinvalCount) {
