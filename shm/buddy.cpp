@@ -12,7 +12,7 @@ int classFor(uint32_t n) {
     // A free block holds its link word, and its last word is the class word
     // of the block above it: on 64-bit targets an 8-byte block cannot hold
     // both, so requests start at class 1 there.
-    const uint64_t needed = std::max(static_cast<uint64_t>(n) + kClassWordSize, 2 * kClassWordSize);
+    const uint64_t needed = std::max<uint64_t>(uint64_t{n} + kClassWordSize, 2 * kClassWordSize);
     for (int k = 0; k < kClassCount; k++) {
         if (needed <= blockSize(k)) return k;
     }

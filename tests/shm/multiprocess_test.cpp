@@ -77,7 +77,7 @@ int worker(const char *name, unsigned seed, int operations) {
 }
 
 pid_t startWorker(const char *name, unsigned seed, int operations) {
-    const pid_t pid = fork();
+    const pid_t pid = forkChild();
     if (pid == 0) {
         alarm(kChildSeconds);
         _exit(worker(name, seed, operations));
@@ -85,11 +85,7 @@ pid_t startWorker(const char *name, unsigned seed, int operations) {
     return pid;
 }
 
-int exitStatusOf(pid_t pid) {
-    int status = 0;
-    if (waitpid(pid, &status, 0) != pid) return -1;
-    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
-}
+int exitStatusOf(pid_t pid) { return waitStatus(pid); }
 
 void expectFreshLists(ShmHandle *h) {
     const BuddyModel fresh(reinterpret_cast<uintptr_t>(h->base), h->size);
@@ -103,7 +99,7 @@ void expectFreshLists(ShmHandle *h) {
 pid_t startLockHolder(const char *name, bool busy) {
     int ready[2];
     if (pipe(ready) != 0) return -1;
-    const pid_t pid = fork();
+    const pid_t pid = forkChild();
     if (pid == 0) {
         alarm(kChildSeconds);
         close(ready[0]);

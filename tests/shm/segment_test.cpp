@@ -6,12 +6,11 @@
 #include "shm_model.h"
 #include "shm_test_util.h"
 
-#include <atomic>
+#include <poll.h>
 #include <cstring>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/file.h>
-#include <thread>
 
 using namespace qorbu::test;
 
@@ -307,7 +306,7 @@ TEST(ShmPublication, AttacherWaitsForLengthThenPublication) {
     const int fd = shm_open(objectPath(name.c_str()).c_str(), O_RDWR | O_CREAT, 0600);
     ASSERT_GE(fd, 0);
     close(fd);
-    const pid_t child = fork();
+    const pid_t child = forkChild();
     if (child == 0) {
         alarm(120);
         ShmHandle *h = ShmOpen(name.c_str(), O_RDWR);
@@ -318,9 +317,7 @@ TEST(ShmPublication, AttacherWaitsForLengthThenPublication) {
     sleep(2);
     ShmHandle *h = ShmCreate(name.c_str(), nullptr, 2 * pageBytes());
     ASSERT_NE(h, nullptr);
-    int status = 0;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "child status " << status;
+    EXPECT_EQ(waitStatus(child), 0);
     EXPECT_EQ(h->base->useFlock, 1u);
     ShmClose(h);
 }
@@ -331,7 +328,7 @@ TEST(ShmPublication, AttacherWaitsForSizeOfASizedSegment) {
     const int fd = shm_open(objectPath(name.c_str()).c_str(), O_RDWR | O_CREAT, 0600);
     ASSERT_GE(fd, 0);
     ASSERT_EQ(ftruncate(fd, 3 * page), 0);
-    const pid_t child = fork();
+    const pid_t child = forkChild();
     if (child == 0) {
         alarm(120);
         ShmHandle *h = ShmOpen(name.c_str(), O_RDONLY);
@@ -351,9 +348,7 @@ TEST(ShmPublication, AttacherWaitsForSizeOfASizedSegment) {
     qorbu::shm::divideDataArea(hdr, uint32_t(3 * page));
     ASSERT_EQ(qorbu::shm::initSegmentMutex(&hdr->mutex), 0);
     qorbu::shm::publishSize(hdr, uint32_t(3 * page));
-    int status = 0;
-    ASSERT_EQ(waitpid(child, &status, 0), child);
-    EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << "child status " << status;
+    EXPECT_EQ(waitStatus(child), 0);
     munmap(p, 3 * page);
     close(fd);
 }
@@ -420,17 +415,25 @@ TEST(ShmFlock, DescriptorLockTakenOnlyAfterASecondReadWriteAttach) {
     second = ShmOpen(name.c_str(), O_RDWR);
     ASSERT_NE(second, nullptr);
     ASSERT_EQ(h->base->useFlock, 1u);
-    std::atomic<bool> done{false};
-    void *block = nullptr;
-    std::thread allocator([&] {
-        block = ShmAlloc(h, 1);
-        done = true;
-    });
-    usleep(300 * 1000);
-    EXPECT_FALSE(done.load()) << "allocated while another description held the descriptor lock";
+    // A child allocates through the first handle and reports when it got
+    // through; it must wait for the descriptor lock held above.
+    int done[2];
+    ASSERT_EQ(pipe(done), 0);
+    const pid_t child = forkChild();
+    if (child == 0) {
+        alarm(120);
+        const char result = ShmAlloc(h, 1) != nullptr ? 'y' : 'n';
+        _exit(write(done[1], &result, 1) == 1 ? 0 : 1);
+    }
+    close(done[1]);
+    pollfd waiting{done[0], POLLIN, 0};
+    EXPECT_EQ(poll(&waiting, 1, 300), 0) << "allocated while another description held the descriptor lock";
     flock(other, LOCK_UN);
-    allocator.join();
-    EXPECT_NE(block, nullptr);
+    char result = 0;
+    EXPECT_EQ(read(done[0], &result, 1), 1);
+    EXPECT_EQ(result, 'y');
+    EXPECT_EQ(waitStatus(child), 0);
+    close(done[0]);
     close(other);
     ShmClose(second);
     ShmClose(h);

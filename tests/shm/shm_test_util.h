@@ -7,12 +7,14 @@
 #include "support/test_support.h"
 
 #include <cerrno>
+#include <cstdio>
 #include <cstdint>
 #include <dirent.h>
 #include <functional>
 #include <signal.h>
 #include <string>
 #include <sys/mman.h>
+#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -43,16 +45,21 @@ class NameGuard {
  * first is free; under qemu-user the executable sits near 0x40000000. */
 constexpr uintptr_t kHeaderCandidates[] = {0x40000000u, 0x60000000u, 0x70000000u, 0x30000000u};
 
-/* Whether [addr, addr + length) holds no mapping of this process. */
+/* Whether [addr, addr + length) holds no mapping of this process. Read from
+ * /proc/self/maps, which qemu-user also shows as the guest sees it. */
 inline bool rangeIsFree(uintptr_t addr, size_t length) {
-    for (size_t off = 0; off < length; off += pageBytes()) {
-        // msync fails with ENOMEM on an unmapped page.
-        if (msync(reinterpret_cast<void *>(addr + off), pageBytes(), MS_ASYNC) == 0 ||
-            errno != ENOMEM) {
-            return false;
+    FILE *maps = fopen("/proc/self/maps", "r");
+    if (maps == nullptr) return false;
+    bool free = true;
+    unsigned long long start = 0, end = 0;
+    char line[512];
+    while (free && fgets(line, sizeof line, maps) != nullptr) {
+        if (sscanf(line, "%llx-%llx", &start, &end) == 2) {
+            free = end <= addr || start >= addr + length;
         }
     }
-    return true;
+    fclose(maps);
+    return free;
 }
 
 /* The first candidate header address whose segment of `length` bytes fits
@@ -85,19 +92,54 @@ inline int openDescriptorCount() {
     return count;
 }
 
-/* Runs body in a child process that the alarm ends after `seconds`; returns
- * its exit status, or 128 + the signal that ended it. */
-inline int runInChild(const std::function<int()> &body, unsigned seconds) {
-    const pid_t pid = fork();
+/* fork() for tests. Under qemu-i386 glibc's fork never returns in the child
+ * of a dynamically linked program, so the child comes from the raw system
+ * call there (the tests' children are single-threaded and only call the
+ * allocator, plain system calls and _exit). */
+inline pid_t forkChild() {
+#if defined(__i386__)
+    if (kEmulated) return static_cast<pid_t>(syscall(SYS_fork));
+#endif
+    return fork();
+}
+
+inline int waitStatus(pid_t pid) {
+    int status = 0;
+    while (waitpid(pid, &status, 0) < 0) {
+        if (errno != EINTR) return -1;
+    }
+    return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+}
+
+struct ChildResult {
+    int status;         // exit status, or 128 + the signal that ended it
+    std::string error;  // what it wrote to standard error
+};
+
+/* Runs body in a child process that the alarm ends after `seconds`. */
+inline ChildResult runInChildCapturingStderr(const std::function<int()> &body, unsigned seconds) {
+    int pipeFds[2];
+    if (pipe(pipeFds) != 0) return {-1, "pipe failed"};
+    const pid_t pid = forkChild();
     if (pid == 0) {
         alarm(seconds);
+        dup2(pipeFds[1], STDERR_FILENO);
+        close(pipeFds[0]);
         _exit(body());
     }
-    int status = 0;
-    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+    close(pipeFds[1]);
+    std::string error;
+    char buffer[256];
+    ssize_t got;
+    while ((got = read(pipeFds[0], buffer, sizeof buffer)) > 0 || (got < 0 && errno == EINTR)) {
+        if (got > 0) error.append(buffer, size_t(got));
     }
-    if (WIFEXITED(status)) return WEXITSTATUS(status);
-    return 128 + WTERMSIG(status);
+    close(pipeFds[0]);
+    return {waitStatus(pid), error};
+}
+
+inline int runInChild(const std::function<int()> &body, unsigned seconds) {
+    return runInChildCapturingStderr(body, seconds).status;
 }
 
 /* The class word stored below a block. */
