@@ -1,0 +1,296 @@
+// Shared-memory allocation: libqorbu's buddy allocator with and without the
+// descriptor lock against Boost.Interprocess managed_shared_memory, with glibc
+// malloc as floor; in one process and in two processes sharing a segment.
+#include <boost/interprocess/managed_shared_memory.hpp>
+
+#include <fcntl.h>
+#include <memory>
+#include <sys/file.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include "harness.h"
+#include "shm/shm.h"
+
+using namespace bench;
+namespace bip = boost::interprocess;
+
+namespace {
+
+constexpr uint32_t kSegment = 256u << 20;
+constexpr int kLive = 10000;
+constexpr uint32_t kMinSize = 16, kMaxSize = 4096;
+
+struct Heap {
+    virtual ~Heap() = default;
+    virtual void *alloc(uint32_t n) = 0;
+    virtual void release(void *p) = 0;
+};
+
+struct QorbuHeap : Heap {
+    ShmHandle *h;
+    explicit QorbuHeap(ShmHandle *handle) : h(handle) {}
+    void *alloc(uint32_t n) override { return ShmAlloc(h, n); }
+    void release(void *p) override { ShmFree(h, p); }
+};
+
+struct BoostHeap : Heap {
+    bip::managed_shared_memory *m;
+    explicit BoostHeap(bip::managed_shared_memory *seg) : m(seg) {}
+    void *alloc(uint32_t n) override { return m->allocate(n, std::nothrow); }
+    void release(void *p) override { m->deallocate(p); }
+};
+
+// The descriptor-lock calls of a locked allocation and free, alone: two
+// each, so four per pair. Every instance opens its own descriptor, so
+// instances in two processes exclude each other like two segment handles.
+struct FlockOnly : Heap {
+    int fd;
+    FlockOnly() : fd(open("/dev/shm", O_RDONLY | O_DIRECTORY | O_CLOEXEC)) {}
+    void *alloc(uint32_t) override {
+        flock(fd, LOCK_EX);
+        flock(fd, LOCK_UN);
+        return this;
+    }
+    void release(void *) override {
+        flock(fd, LOCK_EX);
+        flock(fd, LOCK_UN);
+    }
+};
+
+struct MallocHeap : Heap {
+    void *alloc(uint32_t n) override { return malloc(n); }
+    void release(void *p) override { free(p); }
+};
+
+uint32_t random_size(Rng &r) { return kMinSize + r.below(kMaxSize - kMinSize + 1); }
+
+// A heap with its live blocks: the background every operation runs against.
+struct Workload {
+    Heap *heap;
+    Rng rng;
+    std::vector<void *> live;
+    Workload(Heap *h, int blocks, uint64_t seed) : heap(h), rng(seed) {
+        for (int i = 0; i < blocks; ++i) live.push_back(must(heap->alloc(random_size(rng))));
+    }
+    void release_all() {
+        for (void *p : live) heap->release(p);
+        live.clear();
+    }
+    static void *must(void *p) {
+        if (!p) {
+            perror("allocation failed");
+            abort();
+        }
+        return p;
+    }
+    // size > 0: allocate that size and free it again; size 0: free a random
+    // live block and allocate a random size in its place.
+    long run(uint32_t size, long ops) {
+        if (size)
+            for (long k = 0; k < ops; ++k) {
+                void *p = must(heap->alloc(size));
+                keep(p);
+                heap->release(p);
+            }
+        else
+            for (long k = 0; k < ops; ++k) {
+                void *&slot = live[rng.below(unsigned(live.size()))];
+                heap->release(slot);
+                slot = must(heap->alloc(random_size(rng)));
+            }
+        return ops;
+    }
+};
+
+// --- two processes ---------------------------------------------------------------
+// Each child attaches on its own, keeps half of the live blocks, waits for the
+// start signal and times `ops` operations; the figure is the slower child's
+// time per operation.
+using Attach = std::function<Heap *()>;
+
+double two_processes(const Attach &attach, uint32_t size, long ops) {
+    int ready[2], go[2], result[2];
+    if (pipe(ready) || pipe(go) || pipe(result)) abort();
+    pid_t kids[2];
+    for (int c = 0; c < 2; ++c) {
+        kids[c] = fork();
+        if (kids[c] < 0) abort();
+        if (kids[c] == 0) {
+            Heap *h = attach();
+            Workload w(h, kLive / 2, uint64_t(100 + c));
+            char b = 'r';
+            if (write(ready[1], &b, 1) != 1 || read(go[0], &b, 1) != 1) _exit(1);
+            double t0 = wall_ns();
+            w.run(size, ops);
+            double dt = wall_ns() - t0;
+            if (write(result[1], &dt, sizeof dt) != sizeof dt) _exit(1);
+            w.release_all();
+            _exit(0);
+        }
+    }
+    char b;
+    for (int c = 0; c < 2; ++c)
+        if (read(ready[0], &b, 1) != 1) abort();
+    if (write(go[1], "gg", 2) != 2) abort();
+    double worst = 0;
+    for (int c = 0; c < 2; ++c) {
+        double dt;
+        if (read(result[0], &dt, sizeof dt) != sizeof dt) abort();
+        worst = std::max(worst, dt);
+    }
+    for (pid_t k : kids) {
+        int st;
+        waitpid(k, &st, 0);
+        if (!WIFEXITED(st) || WEXITSTATUS(st) != 0) {
+            fprintf(stderr, "child failed\n");
+            abort();
+        }
+    }
+    for (int fd : {ready[0], ready[1], go[0], go[1], result[0], result[1]}) close(fd);
+    return worst / double(ops);
+}
+
+struct TwoProcContender {
+    Attach attach;
+    uint32_t size;
+    const Options *o;
+    long ops = 0;
+    double operator()() {
+        if (ops == 0) {
+            long n = 20000;
+            double per = two_processes(attach, size, n);
+            ops = std::max(1000L, long(o->sample_ms * 1e6 * o->scale / per));
+        }
+        return two_processes(attach, size, ops);
+    }
+};
+
+std::string name_of(const char *tag) { return "qorbu_bench_" + std::to_string(getpid()) + "_" + tag; }
+
+ShmHandle *create_segment(const std::string &name) {
+    ShmUnlink(name.c_str());
+    ShmHandle *h = ShmCreate(name.c_str(), nullptr, kSegment);
+    if (!h) {
+        perror("ShmCreate");
+        exit(1);
+    }
+    return h;
+}
+
+} // namespace
+
+int main(int argc, char **argv) {
+    Options o = Options::parse(argc, argv);
+
+    // libqorbu: one segment never attached again (no descriptor lock), one
+    // with a second read-write handle (every operation takes the descriptor
+    // lock), one for the two-process runs.
+    std::string n_nolock = name_of("nolock"), n_lock = name_of("lock"), n_two = name_of("two");
+    ShmHandle *nolock = create_segment(n_nolock);
+    ShmHandle *lock = create_segment(n_lock);
+    ShmHandle *second = ShmOpen(n_lock.c_str(), O_RDWR);
+    ShmHandle *two = create_segment(n_two);
+    if (!second || !two) {
+        perror("ShmOpen");
+        return 1;
+    }
+    std::string b_one = name_of("boost1"), b_two = name_of("boost2");
+    bip::shared_memory_object::remove(b_one.c_str());
+    bip::shared_memory_object::remove(b_two.c_str());
+    bip::managed_shared_memory boost_one(bip::create_only, b_one.c_str(), kSegment);
+    bip::managed_shared_memory boost_two(bip::create_only, b_two.c_str(), kSegment);
+
+    QorbuHeap q_nolock(nolock), q_lock(lock);
+    BoostHeap bh(&boost_one);
+    MallocHeap mh;
+    FlockOnly fh;
+    const char *names[] = {"libqorbu", "libqorbu+flock", "Boost.Interprocess", "glibc malloc", "4 flock calls"};
+    Role roles[] = {Role::Ours, Role::Ours, Role::Peer, Role::Floor, Role::Floor};
+    Heap *heaps[] = {&q_nolock, &q_lock, &bh, &mh, &fh};
+    constexpr int kOne = 5;
+    std::vector<std::unique_ptr<Workload>> ws;
+    for (Heap *h : heaps) ws.emplace_back(new Workload(h, kLive, 7));
+
+    Section one{"shm_one_process", "Shared memory: one process",
+                "With 10^4 live blocks of random sizes 16..4096 bytes in the heap, one operation is an "
+                "allocation of the given size and its free (rows with a size), or the free of a random live "
+                "block and the allocation of a random size 16..4096 in its place (mixed). libqorbu: a segment "
+                "with one handle (no descriptor lock) and one with a second read-write handle attached, where "
+                "every operation also takes and releases the `flock` descriptor lock. The last floor is the four "
+                "`flock` calls of a locked pair alone, the part of the locked figure that the locking protocol fixes.",
+                "block size (bytes)", "block size (bytes)", true, {}, {}, {}};
+    for (int i = 0; i < kOne; ++i) one.columns.push_back({names[i], roles[i]});
+
+    std::vector<std::shared_ptr<Timed>> timers;
+    auto figure = [&](uint32_t size) {
+        std::vector<Contender> cs;
+        for (int i = 0; i < kOne; ++i) {
+            Workload *w = ws[size_t(i)].get();
+
+            auto t = std::make_shared<Timed>(o, [w, size](long ops) { return w->run(size, ops); });
+            timers.push_back(t);
+            cs.push_back({names[i], roles[i], [t] { return (*t)(); }});
+        }
+        return interleave(o, cs);
+    };
+    for (uint32_t size : {16u, 64u, 256u, 1024u, 4096u}) one.add(std::to_string(size), size, "", figure(size));
+    one.add("mixed 16..4096", NAN, "", figure(0));
+    fprintf(stderr, "shm: one process done\n");
+
+    Section twop{"shm_two_processes", "Shared memory: two processes",
+                 "Two processes attached to one segment (each with its own handle, so libqorbu takes the "
+                 "descriptor lock as its protocol requires), each with 5000 live blocks, run the operation "
+                 "at the same time; the figure is the slower process's time per operation. glibc malloc: "
+                 "two processes with private heaps, for reference. 4 flock calls: the descriptor-lock calls "
+                 "of a locked pair alone, both processes locking the same file.",
+                 "operation", "", false,
+                 {{"libqorbu", Role::Ours},
+                  {"Boost.Interprocess", Role::Peer},
+                  {"glibc malloc", Role::Floor},
+                  {"4 flock calls", Role::Floor}},
+                 {},
+                 {}};
+    std::string two_name = n_two;
+    std::vector<Attach> attach = {
+        [two_name]() -> Heap * {
+            ShmHandle *h = ShmOpen(two_name.c_str(), O_RDWR);
+            if (!h) {
+                perror("ShmOpen");
+                _exit(1);
+            }
+            return new QorbuHeap(h);
+        },
+        [b_two]() -> Heap * { return new BoostHeap(new bip::managed_shared_memory(bip::open_only, b_two.c_str())); },
+        []() -> Heap * { return new MallocHeap; },
+        []() -> Heap * { return new FlockOnly; },
+    };
+    for (uint32_t size : {0u, 256u}) {
+        std::vector<Contender> cs;
+        for (size_t i = 0; i < attach.size(); ++i) {
+            auto t = std::make_shared<TwoProcContender>(TwoProcContender{attach[i], size, &o});
+            cs.push_back({twop.columns[i].name, twop.columns[i].role, [t] { return (*t)(); }});
+        }
+        twop.add(size ? "pair of 256 bytes" : "mixed 16..4096", NAN, "", interleave(o, cs));
+    }
+    fprintf(stderr, "shm: two processes done\n");
+
+    auto boost = [](const Section &s) { return [&s](size_t r) { return s.at(r, "Boost.Interprocess"); }; };
+    one.verdicts.push_back(check(one, "without the descriptor lock at most a quarter of Boost's cost (ratio to Boost)",
+                                 "libqorbu", boost(one), 0.25));
+    one.verdicts.push_back(check(one, "with the descriptor lock at most 3x Boost's cost", "libqorbu+flock", boost(one),
+                                 3.0));
+    twop.verdicts.push_back(check(twop, "two contending processes at most Boost's cost", "libqorbu", boost(twop), 1.0));
+    write(o, one);
+    write(o, twop);
+
+    for (auto &w : ws) w->release_all();
+    ShmClose(nolock);
+    ShmClose(second);
+    ShmClose(lock);
+    ShmClose(two);
+    for (auto &n : {n_nolock, n_lock, n_two}) ShmUnlink(n.c_str());
+    bip::shared_memory_object::remove(b_one.c_str());
+    bip::shared_memory_object::remove(b_two.c_str());
+    return 0;
+}

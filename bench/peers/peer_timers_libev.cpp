@@ -1,0 +1,42 @@
+// libev side of the timer comparison.
+#include <ev.h>
+
+#include <memory>
+
+#include "timer_set.h"
+
+namespace timers {
+
+namespace {
+
+// --- libev -------------------------------------------------------------------
+void libev_fire(struct ev_loop *, ev_timer *, int) { ++fired; }
+
+struct LibevTimers : TimerSet {
+    struct ev_loop *loop;
+    std::unique_ptr<ev_timer[]> t;
+    explicit LibevTimers(long count) {
+        n = count;
+        loop = ev_loop_new(EVFLAG_AUTO);
+        t.reset(new ev_timer[size_t(n + 1)]);
+        for (long i = 0; i <= n; ++i) ev_timer_init(&t[size_t(i)], libev_fire, 0., 0.);
+    }
+    ~LibevTimers() override { ev_loop_destroy(loop); }
+    void arm(long i, long us) override {
+        if (us < kNearSpanUs) ev_now_update(loop); // near deadlines count from now
+        ev_timer_set(&t[size_t(i)], double(us) * 1e-6, 0.);
+        ev_timer_start(loop, &t[size_t(i)]);
+    }
+    void cancel(long i) override { ev_timer_stop(loop, &t[size_t(i)]); }
+    void rearm(long i, long us) override {
+        t[size_t(i)].repeat = double(us) * 1e-6;
+        ev_timer_again(loop, &t[size_t(i)]);
+    }
+    void one_pass() override { ev_run(loop, EVRUN_NOWAIT); }
+};
+
+} // namespace
+
+TimerSet *make_libev_timers(long n) { return new LibevTimers(n); }
+
+} // namespace timers

@@ -1,0 +1,467 @@
+/* qorbu-demo: a small host daemon on libqorbu. One OS thread runs the
+ * selector with the host's own task scheduler handed over (SelSetZG), a
+ * Net-SNMP master agent serviced by the select loop, a TCP echo service in
+ * green threads with per-connection records in a shared segment, and a
+ * periodic status line. SIGINT and SIGTERM stop it cleanly. */
+#define _GNU_SOURCE
+#include <arpa/inet.h>
+#include <errno.h>
+#include <fcntl.h>
+#include <ftw.h>
+#include <getopt.h>
+#include <signal.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/mman.h>
+#include <unistd.h>
+
+#include "demo.h"
+#include "inspect.h"
+#include "selftest.h"
+#include "snmp_agent.h"
+
+enum {
+    kExitOk = 0,
+    kExitFailure = 1,
+    kExitUsage = 2,
+    kDefaultPort = 7007,
+    kDefaultSnmpPort = 1161,
+    kDefaultStatusMs = 5000,
+    kSelfTestStatusMs = 500,
+    kDefaultClients = 8,
+    kDefaultRounds = 64,
+    kMaxClients = 500,
+    kStopGraceMs = 5000,
+};
+
+static const char kUsage[] =
+    "usage: qorbu-demo [options]\n"
+    "       qorbu-demo --self-test [--clients N] [--rounds N] [options]\n"
+    "\n"
+    "A host daemon on libqorbu: TCP echo on 127.0.0.1 in green threads, an SNMP\n"
+    "agent on udp:127.0.0.1, per-connection records in a shared segment, a status\n"
+    "line on standard error. SIGINT or SIGTERM stops it (exit status 0).\n"
+    "\n"
+    "  --port N              echo port (default 7007; self-test: any free port)\n"
+    "  --snmp-port N         SNMP agent port (default 1161; self-test: any free port)\n"
+    "  --segment NAME        shared segment name (default qorbu-demo;\n"
+    "                        self-test: qorbu-demo-selftest-PID)\n"
+    "  --segment-size BYTES  data bytes of the segment (default 1048576)\n"
+    "  --segment-address A   data area address, a multiple of 4096 (hex with 0x)\n"
+    "  --status-interval MS  period of the status line (default 5000; self-test 500)\n"
+    "  --self-test           run clients, snmpget and a second process, print a\n"
+    "                        summary and exit 0 only when every check held\n"
+    "  --clients N           self-test client green threads (default 8, at most 500)\n"
+    "  --rounds N            echo round trips per client (default 64)\n"
+    "  --help                this text\n"
+    "\n"
+    "Exit status: 0 success, 1 failure (start-up or a failed self-test check),\n"
+    "2 bad command line.\n";
+
+static volatile sig_atomic_t signalWritePipe = -1;
+
+/* ---- small helpers -------------------------------------------------------- */
+
+double demo_seconds_since(const struct timespec *since)
+{
+    struct timespec now;
+    SelGetTime(&now);
+    return (double)(now.tv_sec - since->tv_sec) + (double)(now.tv_nsec - since->tv_nsec) / 1e9;
+}
+
+static int parse_unsigned(const char *text, unsigned long long max, unsigned long long *value)
+{
+    char *end;
+    errno = 0;
+    unsigned long long parsed = strtoull(text, &end, 0);
+    if (errno != 0 || end == text || *end != '\0' || text[0] == '-' || parsed > max)
+        return -1;
+    *value = parsed;
+    return 0;
+}
+
+/* ---- options -------------------------------------------------------------- */
+
+enum OptionId {
+    OPT_PORT = 1000, OPT_SNMP_PORT, OPT_SEGMENT, OPT_SEGMENT_SIZE, OPT_SEGMENT_ADDRESS,
+    OPT_STATUS, OPT_SELF_TEST, OPT_CLIENTS, OPT_ROUNDS, OPT_INSPECT, OPT_HELP
+};
+
+static const struct option kOptions[] = {
+    {"port", required_argument, NULL, OPT_PORT},
+    {"snmp-port", required_argument, NULL, OPT_SNMP_PORT},
+    {"segment", required_argument, NULL, OPT_SEGMENT},
+    {"segment-size", required_argument, NULL, OPT_SEGMENT_SIZE},
+    {"segment-address", required_argument, NULL, OPT_SEGMENT_ADDRESS},
+    {"status-interval", required_argument, NULL, OPT_STATUS},
+    {"self-test", no_argument, NULL, OPT_SELF_TEST},
+    {"clients", required_argument, NULL, OPT_CLIENTS},
+    {"rounds", required_argument, NULL, OPT_ROUNDS},
+    {"inspect", required_argument, NULL, OPT_INSPECT},
+    {"help", no_argument, NULL, OPT_HELP},
+    {NULL, 0, NULL, 0},
+};
+
+typedef struct OptionLimits {
+    int id;
+    const char *name;
+    unsigned long long min, max;
+} OptionLimits;
+
+static const OptionLimits kNumericOptions[] = {
+    {OPT_PORT, "--port", 0, 65535},
+    {OPT_SNMP_PORT, "--snmp-port", 0, 65535},
+    {OPT_SEGMENT_SIZE, "--segment-size", 4096, 0x40000000u},
+    {OPT_SEGMENT_ADDRESS, "--segment-address", 4096, UINTPTR_MAX},
+    {OPT_STATUS, "--status-interval", 10, 3600000},
+    {OPT_CLIENTS, "--clients", 1, kMaxClients},
+    {OPT_ROUNDS, "--rounds", 1, 100000},
+};
+
+static int parse_numeric_option(int id, const char *text, unsigned long long *value)
+{
+    for (size_t i = 0; i < sizeof kNumericOptions / sizeof kNumericOptions[0]; ++i) {
+        const OptionLimits *limits = &kNumericOptions[i];
+        if (limits->id != id)
+            continue;
+        if (parse_unsigned(text, limits->max, value) != 0 || *value < limits->min) {
+            fprintf(stderr, "qorbu-demo: %s wants a number from %llu to %llu, not '%s'\n", limits->name,
+                    limits->min, limits->max, text);
+            return -1;
+        }
+        return 0;
+    }
+    return -1;
+}
+
+static void apply_numeric_option(DemoOptions *options, int id, unsigned long long value, int *portSet,
+                                 int *snmpPortSet, int *statusSet)
+{
+    switch (id) {
+    case OPT_PORT: options->port = (unsigned int)value; *portSet = 1; break;
+    case OPT_SNMP_PORT: options->snmpPort = (unsigned int)value; *snmpPortSet = 1; break;
+    case OPT_SEGMENT_SIZE: options->segmentSize = (uint32_t)value; break;
+    case OPT_SEGMENT_ADDRESS: options->segmentAddress = (uintptr_t)value; break;
+    case OPT_STATUS: options->statusIntervalMs = (unsigned int)value; *statusSet = 1; break;
+    case OPT_CLIENTS: options->clients = (unsigned int)value; break;
+    case OPT_ROUNDS: options->rounds = (unsigned int)value; break;
+    default: break;
+    }
+}
+
+/* 0: run; 1: done (help printed); -1: bad command line. */
+static int parse_options(int argc, char **argv, DemoOptions *options, char *nameBuffer, size_t nameSize)
+{
+    *options = (DemoOptions){.clients = kDefaultClients, .rounds = kDefaultRounds, .port = kDefaultPort,
+                             .snmpPort = kDefaultSnmpPort, .segmentName = "qorbu-demo",
+                             .segmentSize = DEMO_SEGMENT_SIZE, .segmentAddress = DEMO_SEGMENT_ADDRESS,
+                             .statusIntervalMs = kDefaultStatusMs};
+    int portSet = 0, snmpPortSet = 0, statusSet = 0, segmentSet = 0, option;
+    opterr = 0;
+    while ((option = getopt_long(argc, argv, "h", kOptions, NULL)) != -1) {
+        unsigned long long value;
+        switch (option) {
+        case OPT_SELF_TEST: options->selfTest = 1; break;
+        case OPT_SEGMENT: options->segmentName = optarg; segmentSet = 1; break;
+        case OPT_INSPECT: options->inspect = optarg; break;
+        case OPT_HELP:
+        case 'h': fputs(kUsage, stdout); return 1;
+        case '?':
+            fprintf(stderr, "qorbu-demo: unknown option or missing value: %s (try --help)\n", argv[optind - 1]);
+            return -1;
+        default:
+            if (parse_numeric_option(option, optarg, &value) != 0)
+                return -1;
+            apply_numeric_option(options, option, value, &portSet, &snmpPortSet, &statusSet);
+        }
+    }
+    if (optind < argc) {
+        fprintf(stderr, "qorbu-demo: unexpected argument '%s' (try --help)\n", argv[optind]);
+        return -1;
+    }
+    if (options->segmentAddress % 4096 != 0) {
+        fprintf(stderr, "qorbu-demo: --segment-address must be a multiple of 4096\n");
+        return -1;
+    }
+    if (options->selfTest) {
+        if (!portSet)
+            options->port = 0;
+        if (!snmpPortSet)
+            options->snmpPort = 0;
+        if (!statusSet)
+            options->statusIntervalMs = kSelfTestStatusMs;
+        if (!segmentSet) {
+            snprintf(nameBuffer, nameSize, "qorbu-demo-selftest-%d", (int)getpid());
+            options->segmentName = nameBuffer;
+        }
+    }
+    return 0;
+}
+
+/* ---- the segment ---------------------------------------------------------- */
+
+/* Refuses an address range that something in this process already uses:
+ * the segment is mapped there with MAP_FIXED, which would replace it. */
+static int range_is_free(uintptr_t start, size_t length)
+{
+    void *probe = mmap((void *)start, length, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_FIXED_NOREPLACE, -1, 0);
+    if (probe == MAP_FAILED)
+        return 0;
+    munmap(probe, length);
+    return probe == (void *)start; /* kernels before 4.17 treat the flag as a hint */
+}
+
+static int segment_exists(const char *name)
+{
+    char object[256];
+    snprintf(object, sizeof object, "/%s", name);
+    int fd = shm_open(object, O_RDONLY, 0);
+    if (fd < 0)
+        return 0;
+    close(fd);
+    return 1;
+}
+
+static int create_segment(Demo *demo)
+{
+    const DemoOptions *options = &demo->options;
+    const size_t page = (size_t)ShmOverhead();
+    const size_t length = page + ((options->segmentSize + page - 1) / page) * page;
+    if (segment_exists(options->segmentName)) {
+        fprintf(stderr, "qorbu-demo: segment %s already exists (another qorbu-demo? remove it with "
+                        "'qorbu-shm unlink %s')\n", options->segmentName, options->segmentName);
+        return -1;
+    }
+    if (!range_is_free(options->segmentAddress - page, length)) {
+        fprintf(stderr, "qorbu-demo: the address range at %#lx is in use; choose --segment-address\n",
+                (unsigned long)(options->segmentAddress - page));
+        return -1;
+    }
+    demo->segment = ShmCreate(options->segmentName, (void *)options->segmentAddress, options->segmentSize);
+    if (!demo->segment) {
+        fprintf(stderr, "qorbu-demo: cannot create segment %s: %s\n", options->segmentName, strerror(errno));
+        return -1;
+    }
+    demo->summary = ShmMetadata(demo->segment, sizeof *demo->summary);
+    memset(demo->summary, 0, sizeof *demo->summary);
+    demo->summary->magic = DEMO_SUMMARY_MAGIC;
+    demo->summary->pid = (int32_t)getpid();
+    demo->freeAtStart = ShmTotalFree(demo->segment);
+    return 0;
+}
+
+static void remove_segment(Demo *demo)
+{
+    if (!demo->segment)
+        return;
+    ShmClose(demo->segment);
+    demo->segment = NULL;
+    demo->summary = NULL;
+    ShmUnlink(demo->options.segmentName);
+}
+
+/* ---- the SNMP agent's view ------------------------------------------------ */
+
+static uint32_t agent_open_connections(void *arg) { return ((Demo *)arg)->summary->openConnections; }
+static uint64_t agent_bytes_echoed(void *arg) { return ((Demo *)arg)->summary->bytesEchoed; }
+static uint32_t agent_segment_free(void *arg) { return ShmTotalFree(((Demo *)arg)->segment); }
+
+static int remove_entry(const char *path, const struct stat *st, int flag, struct FTW *ftw)
+{
+    (void)st, (void)flag, (void)ftw;
+    remove(path);
+    return 0;
+}
+
+static int start_agent(Demo *demo)
+{
+    strcpy(demo->stateDir, "/tmp/qorbu-demo-snmp-XXXXXX");
+    if (!mkdtemp(demo->stateDir)) {
+        perror("qorbu-demo: mkdtemp");
+        demo->stateDir[0] = '\0';
+        return -1;
+    }
+    /* snmpget, run by the self-test, reads its configuration from here. */
+    setenv("SNMPCONFPATH", demo->stateDir, 1);
+    setenv("SNMP_PERSISTENT_DIR", demo->stateDir, 1);
+    demo->snmpPort = demo->options.snmpPort ? demo->options.snmpPort : agent_pick_free_port();
+    AgentSource source = {agent_open_connections, agent_bytes_echoed, agent_segment_free, demo};
+    return agent_start(&source, demo->snmpPort, demo->stateDir);
+}
+
+static void stop_agent(Demo *demo)
+{
+    agent_stop();
+    if (demo->stateDir[0])
+        nftw(demo->stateDir, remove_entry, 8, FTW_DEPTH | FTW_PHYS);
+}
+
+/* ---- status line ---------------------------------------------------------- */
+
+static void log_status(Demo *demo)
+{
+    ++demo->statusLines;
+    fprintf(stderr,
+            "qorbu-demo: status: %u connections open, %u accepted, %llu bytes echoed, %u of %u segment "
+            "bytes free, up %.1f s\n",
+            demo->summary->openConnections, demo->summary->acceptedTotal,
+            (unsigned long long)demo->summary->bytesEchoed, ShmTotalFree(demo->segment), demo->freeAtStart,
+            demo_seconds_since(&demo->started));
+}
+
+static int on_status_timer(SelTimer *timer)
+{
+    Demo *demo = timer->arg;
+    log_status(demo);
+    if (!demo->stopping)
+        SelSleep(timer, demo->options.statusIntervalMs);
+    return 0;
+}
+
+/* ---- stopping ------------------------------------------------------------- */
+
+static void on_stop_grace_expired(void *arg)
+{
+    (void)arg;
+    fprintf(stderr, "qorbu-demo: connections did not close within %d ms, exiting\n", kStopGraceMs);
+    _exit(kExitFailure);
+}
+
+static void stop_now(void *arg)
+{
+    Demo *demo = arg;
+    if (demo->stopping)
+        return;
+    demo->stopping = 1;
+    SelRemTimer(&demo->statusTimer);
+    echo_stop(&demo->echo);
+    if (demo->selfTest)
+        selftest_stop(demo->selfTest);
+    host_after(&demo->host, HOST_LIST_URGENT, kStopGraceMs, on_stop_grace_expired, demo);
+}
+
+void demo_request_stop(Demo *demo, const char *reason)
+{
+    if (!demo->stopping)
+        fprintf(stderr, "qorbu-demo: stopping: %s\n", reason);
+    host_post(&demo->host, stop_now, demo);
+}
+
+/* The handlers only note the signal in a pipe that the host scheduler
+ * watches; the stop itself runs as a host task on the loop. */
+static void on_signal(int signo)
+{
+    int saved = errno;
+    unsigned char byte = (unsigned char)signo;
+    if (signalWritePipe >= 0 && write(signalWritePipe, &byte, 1) < 0) {
+        /* the pipe is full: a stop is already pending */
+    }
+    errno = saved;
+}
+
+static void on_signal_pipe(void *arg)
+{
+    Demo *demo = arg;
+    unsigned char bytes[16];
+    ssize_t n = read(demo->signalPipe[0], bytes, sizeof bytes);
+    if (n > 0)
+        demo_request_stop(demo, bytes[n - 1] == SIGINT ? "SIGINT" : "SIGTERM");
+}
+
+static int install_signals(Demo *demo)
+{
+    if (pipe2(demo->signalPipe, O_CLOEXEC | O_NONBLOCK) != 0)
+        return -1;
+    signalWritePipe = demo->signalPipe[1];
+    if (host_watch_fd(&demo->host, demo->signalPipe[0], on_signal_pipe, demo) != 0)
+        return -1;
+    struct sigaction action;
+    memset(&action, 0, sizeof action);
+    action.sa_handler = on_signal;
+    sigemptyset(&action.sa_mask);
+    /* No SA_RESTART: the select loop's wait returns with EINTR. The signals
+     * stay blocked except during that wait (SelAddSignal). */
+    if (SelAddSignal(SIGINT) != 0 || SelAddSignal(SIGTERM) != 0 || sigaction(SIGINT, &action, NULL) != 0 ||
+        sigaction(SIGTERM, &action, NULL) != 0)
+        return -1;
+    signal(SIGPIPE, SIG_IGN);
+    return 0;
+}
+
+/* ---- the daemon ----------------------------------------------------------- */
+
+static int start(Demo *demo)
+{
+    if (SelInit() != 0) {
+        perror("qorbu-demo: SelInit");
+        return -1;
+    }
+    host_init(&demo->host);
+    SelSetZG(&demo->host);
+    if (install_signals(demo) != 0) {
+        perror("qorbu-demo: signals");
+        return -1;
+    }
+    if (create_segment(demo) != 0 || start_agent(demo) != 0)
+        return -1;
+    /* After SelAddSignal: every green thread starts with the registered
+     * signals blocked, like the main context. */
+    greenthreads_init();
+    if (echo_start(&demo->echo, demo->segment, demo->summary, demo->options.port) != 0)
+        return -1;
+    demo->statusTimer.arg = demo;
+    demo->statusTimer.callback = on_status_timer;
+    SelSleep(&demo->statusTimer, demo->options.statusIntervalMs);
+    fprintf(stderr, "qorbu-demo: pid %d, echo on 127.0.0.1:%u, SNMP on udp:127.0.0.1:%u, segment %s (%u bytes free)\n",
+            (int)getpid(), (unsigned int)ntohs(demo->echo.address.sin_port), demo->snmpPort,
+            demo->options.segmentName, demo->freeAtStart);
+    if (demo->options.selfTest && !(demo->selfTest = selftest_start(demo)))
+        return -1;
+    return 0;
+}
+
+static void finish(Demo *demo)
+{
+    SelRemTimer(&demo->statusTimer);
+    if (demo->summary)
+        log_status(demo);
+    stop_agent(demo);
+    remove_segment(demo);
+    host_destroy(&demo->host);
+    SelSetZG(NULL);
+    signalWritePipe = -1;
+}
+
+static int run_daemon(Demo *demo)
+{
+    SelGetTime(&demo->started);
+    demo->signalPipe[0] = demo->signalPipe[1] = -1;
+    if (start(demo) != 0) {
+        finish(demo);
+        return kExitFailure;
+    }
+    /* Runs until the last green thread (the acceptor, the connections and
+     * the self-test's threads) has finished. */
+    greenthreads_run();
+    int status = kExitOk;
+    if (demo->selfTest && !selftest_passed(demo->selfTest))
+        status = kExitFailure;
+    selftest_free(demo->selfTest);
+    demo->selfTest = NULL;
+    finish(demo);
+    fprintf(stderr, "qorbu-demo: stopped\n");
+    return status;
+}
+
+int main(int argc, char **argv)
+{
+    static Demo demo;
+    char selfTestName[64];
+    int parsed = parse_options(argc, argv, &demo.options, selfTestName, sizeof selfTestName);
+    if (parsed != 0)
+        return parsed > 0 ? kExitOk : kExitUsage;
+    if (demo.options.inspect)
+        return inspect_segment(demo.options.inspect);
+    return run_daemon(&demo);
+}

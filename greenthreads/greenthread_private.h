@@ -1,0 +1,92 @@
+/* Green-thread internals shared by the scheduler, the stack code, the
+ * descriptor calls and the white-box tests. */
+#ifndef QORBU_GREENTHREADS_GREENTHREAD_PRIVATE_H
+#define QORBU_GREENTHREADS_GREENTHREAD_PRIVATE_H
+
+#include <stddef.h>
+#include <stdint.h>
+#include <ucontext.h>
+
+#include "greenthreads/greenthread.h"
+
+#ifndef QORBU_HIDDEN
+#define QORBU_HIDDEN __attribute__((visibility("hidden")))
+#endif
+
+/* Which sanitizer has to be told about stack switches. */
+#if defined(__SANITIZE_ADDRESS__)
+#define QORBU_GT_ASAN 1
+#elif defined(__has_feature)
+#if __has_feature(address_sanitizer)
+#define QORBU_GT_ASAN 1
+#endif
+#endif
+#if defined(__SANITIZE_THREAD__)
+#define QORBU_GT_TSAN 1
+#elif defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+#define QORBU_GT_TSAN 1
+#endif
+#endif
+
+/* One record per green thread plus one for the main context. The field
+ * order is fixed: debuggers and the host's tools read it. */
+struct Greenthread {
+    ucontext_t context; /* uc_stack names the whole mapping, guard page included */
+    Greenthread *next;  /* run queue link; free-list link once finished */
+    int32_t runnable;   /* 1 while running or queued, 0 while blocked or finished */
+    GreenthreadEntry entry;
+    void *arg;
+#ifdef QORBU_GT_TSAN
+    void *tsanFiber;    /* ThreadSanitizer builds only */
+#endif
+};
+
+static_assert(offsetof(Greenthread, context) == 0);
+static_assert(offsetof(Greenthread, next) == sizeof(ucontext_t));
+static_assert(offsetof(Greenthread, runnable) == sizeof(ucontext_t) + sizeof(void *));
+#if UINTPTR_MAX == 0xffffffffu
+static_assert(offsetof(Greenthread, entry) == sizeof(ucontext_t) + 8);
+static_assert(offsetof(Greenthread, arg) == sizeof(ucontext_t) + 12);
+#ifndef QORBU_GT_TSAN
+static_assert(sizeof(Greenthread) == sizeof(ucontext_t) + 16);
+#endif
+#endif
+
+namespace qorbu::gt {
+
+/* Usable stack of every green thread, before rounding up to whole pages. */
+inline constexpr size_t kStackSize = 16384;
+
+/* Process-wide scheduler state; only the thread that called
+ * greenthreads_init touches it. */
+QORBU_HIDDEN extern Greenthread *run_queue_head;
+QORBU_HIDDEN extern Greenthread *run_queue_tail;
+QORBU_HIDDEN extern Greenthread *current_thread;
+QORBU_HIDDEN extern Greenthread *free_threads;
+QORBU_HIDDEN extern Greenthread *main_thread;
+QORBU_HIDDEN extern long page_size;
+QORBU_HIDDEN extern int live_threads;
+
+QORBU_HIDDEN void run_queue_append(Greenthread *thread);
+[[noreturn]] QORBU_HIDDEN void greenthread_start();
+
+/* One turn of the run loop: hand the processor to the queued threads if
+ * there are any, otherwise wait once in the selector. */
+QORBU_HIDDEN void run_one_turn();
+
+/* True in the main context, and before greenthreads_init: there the caller
+ * must not block, it has to drive the run loop itself. */
+inline bool in_main_context() { return current_thread == main_thread; }
+
+/* Stacks (stack.cpp). */
+QORBU_HIDDEN size_t stack_mapping_length(long pageSize);
+QORBU_HIDDEN bool process_wants_executable_stack();
+/* Maps a stack of stack_mapping_length() bytes whose lowest page is the
+ * guard page; null (errno set) when the mapping fails. */
+QORBU_HIDDEN void *stack_map();
+QORBU_HIDDEN void stack_unmap(void *base);
+
+} // namespace qorbu::gt
+
+#endif

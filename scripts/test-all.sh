@@ -1,0 +1,35 @@
+#!/usr/bin/env bash
+# The whole test suite on a fresh Debian 12 machine: installs what it needs,
+# then builds and runs ctest for x86_64, i386 (qemu), armhf (qemu) and the
+# address/undefined-behaviour sanitizers, and fuzzes the allocator briefly.
+set -uo pipefail
+cd "$(dirname "$0")/.."
+source scripts/require-packages.sh
+
+require_packages cmake ninja-build g++ gcc googletest libbenchmark-dev valgrind pkg-config \
+    g++-arm-linux-gnueabihf g++-i686-linux-gnu qemu-user \
+    libsnmp-dev snmp clang libclang-rt-14-dev dpkg-dev file || exit 1
+
+jobs=$(nproc)
+failed=()
+for preset in default i386 armhf asan; do
+    echo "=== $preset ==="
+    if cmake --preset "$preset" >/dev/null &&
+        cmake --build --preset "$preset" -j"$jobs" &&
+        ctest --preset "$preset"; then
+        echo "=== $preset: passed ==="
+    else
+        failed+=("$preset")
+    fi
+done
+
+if [ -f scripts/fuzz-shm.sh ]; then
+    echo "=== allocator fuzzing ==="
+    bash scripts/fuzz-shm.sh || failed+=(fuzz)
+fi
+
+if ((${#failed[@]})); then
+    echo "FAILED: ${failed[*]}"
+    exit 1
+fi
+echo "all test suites passed"

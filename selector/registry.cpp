@@ -1,0 +1,188 @@
+// The per-thread descriptor registry: one entry per descriptor number, the
+// select-mode interest sets and nfds, or the process-wide epoll instance.
+#include <errno.h>
+#include <stdint.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/epoll.h>
+#include <sys/time.h>
+
+#include "selector/sel_private.h"
+
+using namespace qorbu::sel;
+
+namespace qorbu::sel {
+std::atomic<int> epoll_fd{0};
+} // namespace qorbu::sel
+
+namespace {
+
+constexpr unsigned kRegistrableEvents = SEL_READ | SEL_WRITE | SEL_EXCEPT;
+constexpr size_t kMaxTableEntries = SIZE_MAX / sizeof(SelFdEntry);
+
+void stamp_activity(SelFdEntry *entry) {
+    if (entry->idleTracked == 1)
+        gettimeofday(&entry->lastActivity, nullptr);
+}
+
+uint32_t epoll_events_for(unsigned events) {
+    uint32_t mask = 0;
+    if (events & SEL_READ)
+        mask |= EPOLLIN;
+    if (events & SEL_WRITE)
+        mask |= EPOLLOUT;
+    if (events & SEL_EXCEPT)
+        mask |= EPOLLERR | EPOLLHUP;
+    return mask;
+}
+
+void set_interest(SelContext *ctx, int fd, unsigned events) {
+    if (events & SEL_READ)
+        FD_SET(fd, &ctx->readSet);
+    if (events & SEL_WRITE)
+        FD_SET(fd, &ctx->writeSet);
+    if (events & SEL_EXCEPT)
+        FD_SET(fd, &ctx->exceptSet);
+}
+
+void clear_interest(SelContext *ctx, int fd, unsigned events) {
+    if (events & SEL_READ)
+        FD_CLR(fd, &ctx->readSet);
+    if (events & SEL_WRITE)
+        FD_CLR(fd, &ctx->writeSet);
+    if (events & SEL_EXCEPT)
+        FD_CLR(fd, &ctx->exceptSet);
+}
+
+void clear_everywhere(SelContext *ctx, int fd) {
+    clear_interest(ctx, fd, kRegistrableEvents);
+    FD_CLR(fd, &ctx->readyRead);
+    FD_CLR(fd, &ctx->readyWrite);
+    FD_CLR(fd, &ctx->readyExcept);
+}
+
+// nfds becomes one past the highest descriptor still registered, 1 when none is.
+void lower_nfds(SelContext *ctx, int fd) {
+    int i = fd;
+    while (i > 0 && ctx->fdTable[i].events == 0)
+        --i;
+    ctx->nfds = i + 1;
+}
+
+int add_to_epoll(int epfd, int fd, unsigned events) {
+    struct epoll_event ev;
+    memset(&ev, 0, sizeof ev);
+    ev.events = epoll_events_for(events);
+    ev.data.fd = fd;
+    if (epoll_ctl(epfd, EPOLL_CTL_ADD, fd, &ev) != 0) {
+        errno = EBUSY;
+        return -1;
+    }
+    return 0;
+}
+
+} // namespace
+
+extern "C" {
+
+SelFdEntry *SelFdSlot(SelContext *ctx, int fd) {
+    if (fd >= ctx->fdTableSize) {
+        size_t entries = static_cast<size_t>(fd) + 1;
+        if (entries > kMaxTableEntries) {
+            errno = ENOMEM;
+            return nullptr;
+        }
+        auto *table = static_cast<SelFdEntry *>(realloc(ctx->fdTable, entries * sizeof(SelFdEntry)));
+        if (table == nullptr)
+            return nullptr;
+        memset(table + ctx->fdTableSize, 0, (entries - ctx->fdTableSize) * sizeof(SelFdEntry));
+        ctx->fdTable = table;
+        ctx->fdTableSize = fd + 1;
+    }
+    return &ctx->fdTable[fd];
+}
+
+int SelAddFD(int fd, unsigned int events, int idleTracked, SelFdCallback callback, void *arg) {
+    const int epfd = current_epoll_fd();
+    // A select-mode descriptor must fit in an fd_set.
+    if ((events & ~kRegistrableEvents) != 0 || fd < 0 || (epfd == 0 && fd >= kSelectSetSize)) {
+        errno = EINVAL;
+        return -1;
+    }
+    SelContext *ctx = SelCurrentContext();
+    SelFdEntry *entry = SelFdSlot(ctx, fd);
+    if (entry == nullptr)
+        return -1;
+    if (entry->events != 0) {
+        errno = EBUSY;
+        return -1;
+    }
+    entry->events = events;
+    entry->idleTracked = idleTracked;
+    entry->callback = callback;
+    entry->arg = arg;
+    stamp_activity(entry);
+
+    if (epfd != 0)
+        return add_to_epoll(epfd, fd, events);
+
+    set_interest(ctx, fd, events);
+    if (events != 0 && fd >= ctx->nfds)
+        ctx->nfds = fd + 1;
+    return 0;
+}
+
+int SelRemFD(int fd) {
+    const int epfd = current_epoll_fd();
+    SelContext *ctx = SelCurrentContext();
+    if ((epfd == 0 && fd >= ctx->nfds) || fd < 0) {
+        errno = EINVAL;
+        return -1;
+    }
+    SelFdEntry *entry = SelFdSlot(ctx, fd);
+    if (entry == nullptr)
+        return -1;
+    // Also drops SEL_IN_CALLBACK: a running dispatch step restores nothing.
+    entry->events = 0;
+
+    if (epfd != 0) {
+        if (epoll_ctl(epfd, EPOLL_CTL_DEL, fd, nullptr) != 0) {
+            errno = EINVAL;
+            return -1;
+        }
+        return 0;
+    }
+    clear_everywhere(ctx, fd);
+    if (ctx->nfds == fd + 1)
+        lower_nfds(ctx, fd);
+    return 0;
+}
+
+void *SelGetFDArg(int fd) {
+    SelContext *ctx = SelCurrentContext();
+    if ((current_epoll_fd() == 0 && fd >= ctx->nfds) || fd < 0) {
+        errno = EINVAL;
+        return nullptr;
+    }
+    SelFdEntry *entry = SelFdSlot(ctx, fd);
+    return entry == nullptr ? nullptr : entry->arg;
+}
+
+void SelDispatchFD(SelContext *ctx, int fd, unsigned int event) {
+    SelFdEntry *entry = &ctx->fdTable[fd];
+    const unsigned registered = entry->events;
+    entry->events = registered | SEL_IN_CALLBACK;
+    // While the callback runs, a nested pass neither waits on nor dispatches fd.
+    clear_interest(ctx, fd, registered);
+    stamp_activity(entry);
+
+    entry->callback(fd, event, entry->arg, entry);
+
+    entry = &ctx->fdTable[fd]; // the callback may have moved the table
+    if ((entry->events & SEL_IN_CALLBACK) == 0)
+        return; // removed (and perhaps registered anew) by the callback
+    entry->events &= ~SEL_IN_CALLBACK;
+    set_interest(ctx, fd, entry->events);
+}
+
+} // extern "C"

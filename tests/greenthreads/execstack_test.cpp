@@ -1,0 +1,28 @@
+// This binary is linked with an executable stack: green-thread stacks must
+// then be executable too, as the loader makes every other stack.
+#include <gtest/gtest.h>
+
+#include "greenthreads/greenthread_private.h"
+#include "gt_test_support.h"
+#include "support/test_support.h"
+
+using namespace qorbu::gt;
+using qorbu::test::mapping_at;
+
+namespace {
+
+char *stackBase;
+
+TEST(ExecutableStackProcess, GreenThreadStacksAreExecutableToo)
+{
+    greenthreads_init();
+    EXPECT_TRUE(process_wants_executable_stack());
+    greenthread_create([](void *) { stackBase = static_cast<char *>(current_greenthread()->context.uc_stack.ss_sp); },
+                       nullptr);
+    greenthreads_run();
+    ASSERT_NE(stackBase, nullptr);
+    EXPECT_TRUE(qorbu::test::is_inaccessible(mapping_at(stackBase), qorbu::test::kEmulated));
+    EXPECT_EQ(mapping_at(stackBase + page_size).perms, "rwxp");
+}
+
+} // namespace

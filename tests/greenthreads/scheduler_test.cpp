@@ -1,0 +1,304 @@
+// The run queue, yield/block/wakeup, record reuse and the run loop. Every
+// test case runs in a fresh process, so each starts with a fresh scheduler.
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "greenthreads/greenthread_private.h"
+#include "selector/sel_private.h"
+
+using namespace qorbu::gt;
+
+namespace {
+
+std::string trace;
+
+int queue_length()
+{
+    int n = 0;
+    for (Greenthread *t = run_queue_head; t != nullptr; t = t->next)
+        ++n;
+    return n;
+}
+
+struct Yielder {
+    char name;
+    int turns;
+};
+
+void yield_in_loop(void *arg)
+{
+    auto *self = static_cast<Yielder *>(arg);
+    for (int i = 0; i < self->turns; ++i) {
+        trace += self->name;
+        greenthread_yield();
+    }
+}
+
+void do_nothing(void *) {}
+
+class Scheduler : public ::testing::Test {
+protected:
+    void SetUp() override
+    {
+        trace.clear();
+        ASSERT_EQ(SelInit(), 0);
+        greenthreads_init();
+        ASSERT_NE(current_greenthread(), nullptr);
+    }
+};
+
+TEST_F(Scheduler, QueueIsFifoAndTheMainContextTakesOneTurnPerPass)
+{
+    Yielder a{'A', 3}, b{'B', 3};
+    greenthread_create(yield_in_loop, &a);
+    greenthread_create(yield_in_loop, &b);
+    while (live_threads != 0) {
+        trace += 'M';
+        greenthread_yield();
+    }
+    EXPECT_EQ(trace, "MABMABMABM");
+}
+
+TEST_F(Scheduler, NewThreadWaitsForItsCreatorAndGetsItsArgument)
+{
+    static void *received;
+    static bool ran;
+    received = nullptr;
+    ran = false;
+    int token = 0;
+    greenthread_create(
+        [](void *arg) {
+            ran = true;
+            received = arg;
+        },
+        &token);
+    EXPECT_FALSE(ran);
+    EXPECT_EQ(live_threads, 1);
+    EXPECT_EQ(queue_length(), 1);
+    greenthreads_run();
+    EXPECT_TRUE(ran);
+    EXPECT_EQ(received, &token);
+    EXPECT_EQ(live_threads, 0);
+}
+
+TEST_F(Scheduler, YieldWithNothingElseQueuedReturnsAtOnce)
+{
+    greenthread_yield();
+    EXPECT_EQ(current_greenthread(), main_thread);
+    EXPECT_EQ(run_queue_head, nullptr);
+    EXPECT_EQ(run_queue_tail, nullptr);
+}
+
+TEST_F(Scheduler, FinishedRecordIsReusedWithItsStackAndStartsAfresh)
+{
+    static void *stackMark;
+    static int runs;
+    runs = 0;
+    auto markStack = [](void *arg) {
+        stackMark = __builtin_frame_address(0);
+        *static_cast<int *>(arg) += 1;
+        ++runs;
+    };
+    int first = 0, second = 0;
+    Greenthread *t1 = greenthread_create(markStack, &first);
+    greenthreads_run();
+    void *firstMark = stackMark;
+    EXPECT_EQ(free_threads, t1);
+
+    Greenthread *t2 = greenthread_create(markStack, &second);
+    EXPECT_EQ(t2, t1);
+    EXPECT_EQ(free_threads, nullptr);
+    EXPECT_EQ(live_threads, 1);
+    greenthreads_run();
+    EXPECT_EQ(stackMark, firstMark) << "a reused record restarts at the top of the same stack";
+    EXPECT_EQ(first, 1);
+    EXPECT_EQ(second, 1);
+    EXPECT_EQ(runs, 2);
+    char *base = static_cast<char *>(t1->context.uc_stack.ss_sp);
+    EXPECT_GT(static_cast<char *>(stackMark), base + page_size);
+    EXPECT_LT(static_cast<char *>(stackMark), base + t1->context.uc_stack.ss_size);
+}
+
+TEST_F(Scheduler, NewestFinishedRecordIsReusedFirst)
+{
+    Yielder quick{'A', 1}, slow{'B', 2};
+    Greenthread *a = greenthread_create(yield_in_loop, &quick);
+    Greenthread *b = greenthread_create(yield_in_loop, &slow);
+    greenthreads_run();
+    EXPECT_EQ(trace, "ABB");
+    EXPECT_EQ(free_threads, b);
+    EXPECT_EQ(greenthread_create(do_nothing, nullptr), b);
+    EXPECT_EQ(greenthread_create(do_nothing, nullptr), a);
+    Greenthread *fresh = greenthread_create(do_nothing, nullptr);
+    EXPECT_NE(fresh, a);
+    EXPECT_NE(fresh, b);
+    EXPECT_EQ(live_threads, 3);
+    greenthreads_run();
+    EXPECT_EQ(live_threads, 0);
+}
+
+TEST_F(Scheduler, WakeupOfRunningQueuedOrMainRecordChangesNothing)
+{
+    static Greenthread *other;
+    static int queuedAfterSelfWake;
+    static int queuedAfterMainWake;
+    auto waker = [](void *) {
+        greenthread_wakeup(current_greenthread());
+        queuedAfterSelfWake = queue_length();
+        greenthread_wakeup(main_thread); // the main context is queued here
+        greenthread_wakeup(other);       // and so is the other thread
+        queuedAfterMainWake = queue_length();
+    };
+    Yielder y{'O', 1};
+    greenthread_create(waker, nullptr);
+    other = greenthread_create(yield_in_loop, &y);
+    greenthread_wakeup(main_thread);
+    EXPECT_EQ(queue_length(), 2);
+    greenthreads_run();
+    EXPECT_EQ(queuedAfterSelfWake, 2); // the other thread and the main context
+    EXPECT_EQ(queuedAfterMainWake, 2);
+    EXPECT_EQ(trace, "O");
+}
+
+TEST_F(Scheduler, TwoWakeupsOfABlockedThreadQueueItOnce)
+{
+    static int wakeups;
+    wakeups = 0;
+    Greenthread *sleeper = greenthread_create(
+        [](void *) {
+            greenthread_block();
+            ++wakeups;
+            greenthread_block();
+            ++wakeups;
+        },
+        nullptr);
+    greenthread_yield();
+    EXPECT_EQ(sleeper->runnable, 0);
+    EXPECT_EQ(queue_length(), 0);
+    greenthread_wakeup(sleeper);
+    greenthread_wakeup(sleeper);
+    EXPECT_EQ(queue_length(), 1);
+    greenthread_yield();
+    EXPECT_EQ(wakeups, 1) << "a second queue entry would have run the thread again";
+    EXPECT_EQ(sleeper->runnable, 0);
+    greenthread_wakeup(sleeper);
+    greenthreads_run();
+    EXPECT_EQ(wakeups, 2);
+}
+
+TEST_F(Scheduler, BlockingInTheMainContextOnlyTakesATurn)
+{
+    Yielder a{'A', 2};
+    greenthread_create(yield_in_loop, &a);
+    greenthread_block();
+    EXPECT_EQ(main_thread->runnable, 1);
+    EXPECT_EQ(trace, "A");
+    greenthread_block(); // nothing else runnable after the thread finishes
+    greenthread_block();
+    EXPECT_EQ(live_threads, 0);
+    EXPECT_EQ(current_greenthread(), main_thread);
+}
+
+TEST_F(Scheduler, ThreadsCreateThreadsThatRunInQueueOrder)
+{
+    static std::vector<int> order;
+    order.clear();
+    greenthread_create(
+        [](void *) {
+            order.push_back(1);
+            greenthread_create([](void *) { order.push_back(3); }, nullptr);
+            greenthread_yield();
+            order.push_back(4);
+        },
+        nullptr);
+    greenthread_create([](void *) { order.push_back(2); }, nullptr);
+    greenthreads_run();
+    EXPECT_EQ(order, (std::vector<int>{1, 2, 3, 4}));
+}
+
+// ---------------------------------------------------------------------------
+// The run loop and the selector.
+
+int count_pass(int, unsigned, void *arg, SelFdEntry *)
+{
+    ++*static_cast<int *>(arg);
+    return 0;
+}
+
+TEST_F(Scheduler, RunWithoutThreadsReturnsWithoutWaitingInTheSelector)
+{
+    int fds[2];
+    ASSERT_EQ(pipe(fds), 0);
+    ASSERT_EQ(write(fds[1], "x", 1), 1);
+    int dispatched = 0;
+    ASSERT_EQ(SelAddFD(fds[0], SEL_READ, 0, count_pass, &dispatched), 0);
+    greenthreads_run();
+    EXPECT_EQ(dispatched, 0);
+    SelRemFD(fds[0]);
+    close(fds[0]);
+    close(fds[1]);
+}
+
+struct TimerWake {
+    SelTimer timer;
+    Greenthread *thread;
+};
+
+int wake_from_timer(SelTimer *timer)
+{
+    auto *wake = static_cast<TimerWake *>(timer->arg);
+    greenthread_wakeup(wake->thread);
+    return 0;
+}
+
+void block_until_timer(void *arg)
+{
+    auto *wake = static_cast<TimerWake *>(arg);
+    wake->timer.callback = wake_from_timer;
+    wake->timer.arg = wake;
+    SelMakeWhen(&wake->timer.when, 0, 20 * 1000 * 1000);
+    SelAddTimer(&wake->timer);
+    greenthread_block();
+    trace += 'T';
+}
+
+void run_until_every_thread_blocks_then_timer_wakes_one()
+{
+    TimerWake wake{};
+    wake.thread = greenthread_create(block_until_timer, &wake);
+    Yielder other{'Y', 3};
+    greenthread_create(yield_in_loop, &other);
+    greenthreads_run();
+    EXPECT_EQ(trace, "YYYT");
+    EXPECT_EQ(live_threads, 0);
+    EXPECT_EQ(wake.timer.heapIndex, 0u);
+    EXPECT_EQ(wake.thread->runnable, 0);
+    EXPECT_EQ(free_threads, wake.thread) << "the timer's thread finished last";
+}
+
+TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorUntilTheLastThreadEnds)
+{
+    run_until_every_thread_blocks_then_timer_wakes_one();
+}
+
+TEST_F(Scheduler, InEpollModeTheRunLoopWaitsWithEpoll)
+{
+    ASSERT_EQ(SelUseEpoll(), 0);
+    ASSERT_NE(GetEpollFd(), 0);
+    run_until_every_thread_blocks_then_timer_wakes_one();
+    DeInitEpoll();
+}
+
+TEST(SchedulerUninitialised, CallsBeforeInitDoNothingHarmful)
+{
+    EXPECT_EQ(current_greenthread(), nullptr);
+    EXPECT_EQ(greenthread_create(do_nothing, nullptr), nullptr);
+    greenthread_yield();
+    greenthread_block();
+    greenthreads_run();
+    EXPECT_EQ(live_threads, 0);
+}
+
+} // namespace
