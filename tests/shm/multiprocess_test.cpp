@@ -77,7 +77,7 @@ int worker(const char *name, unsigned seed, int operations) {
 }
 
 pid_t startWorker(const char *name, unsigned seed, int operations) {
-    const pid_t pid = forkChild();
+    const pid_t pid = fork();
     if (pid == 0) {
         alarm(kChildSeconds);
         _exit(worker(name, seed, operations));
@@ -99,7 +99,7 @@ void expectFreshLists(ShmHandle *h) {
 pid_t startLockHolder(const char *name, bool busy) {
     int ready[2];
     if (pipe(ready) != 0) return -1;
-    const pid_t pid = forkChild();
+    const pid_t pid = fork();
     if (pid == 0) {
         alarm(kChildSeconds);
         close(ready[0]);

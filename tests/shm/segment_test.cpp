@@ -306,7 +306,7 @@ TEST(ShmPublication, AttacherWaitsForLengthThenPublication) {
     const int fd = shm_open(objectPath(name.c_str()).c_str(), O_RDWR | O_CREAT, 0600);
     ASSERT_GE(fd, 0);
     close(fd);
-    const pid_t child = forkChild();
+    const pid_t child = fork();
     if (child == 0) {
         alarm(120);
         ShmHandle *h = ShmOpen(name.c_str(), O_RDWR);
@@ -328,7 +328,7 @@ TEST(ShmPublication, AttacherWaitsForSizeOfASizedSegment) {
     const int fd = shm_open(objectPath(name.c_str()).c_str(), O_RDWR | O_CREAT, 0600);
     ASSERT_GE(fd, 0);
     ASSERT_EQ(ftruncate(fd, 3 * page), 0);
-    const pid_t child = forkChild();
+    const pid_t child = fork();
     if (child == 0) {
         alarm(120);
         ShmHandle *h = ShmOpen(name.c_str(), O_RDONLY);
@@ -419,7 +419,7 @@ TEST(ShmFlock, DescriptorLockTakenOnlyAfterASecondReadWriteAttach) {
     // through; it must wait for the descriptor lock held above.
     int done[2];
     ASSERT_EQ(pipe(done), 0);
-    const pid_t child = forkChild();
+    const pid_t child = fork();
     if (child == 0) {
         alarm(120);
         const char result = ShmAlloc(h, 1) != nullptr ? 'y' : 'n';

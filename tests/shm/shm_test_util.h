@@ -14,7 +14,6 @@
 #include <signal.h>
 #include <string>
 #include <sys/mman.h>
-#include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
@@ -92,17 +91,6 @@ inline int openDescriptorCount() {
     return count;
 }
 
-/* fork() for tests. Under qemu-i386 glibc's fork never returns in the child
- * of a dynamically linked program, so the child comes from the raw system
- * call there (the tests' children are single-threaded and only call the
- * allocator, plain system calls and _exit). */
-inline pid_t forkChild() {
-#if defined(__i386__)
-    if (kEmulated) return static_cast<pid_t>(syscall(SYS_fork));
-#endif
-    return fork();
-}
-
 inline int waitStatus(pid_t pid) {
     int status = 0;
     while (waitpid(pid, &status, 0) < 0) {
@@ -111,35 +99,15 @@ inline int waitStatus(pid_t pid) {
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
-struct ChildResult {
-    int status;         // exit status, or 128 + the signal that ended it
-    std::string error;  // what it wrote to standard error
-};
-
-/* Runs body in a child process that the alarm ends after `seconds`. */
-inline ChildResult runInChildCapturingStderr(const std::function<int()> &body, unsigned seconds) {
-    int pipeFds[2];
-    if (pipe(pipeFds) != 0) return {-1, "pipe failed"};
-    const pid_t pid = forkChild();
+/* Runs body in a child process that the alarm ends after `seconds`; returns
+ * its exit status, or 128 + the signal that ended it. */
+inline int runInChild(const std::function<int()> &body, unsigned seconds) {
+    const pid_t pid = fork();
     if (pid == 0) {
         alarm(seconds);
-        dup2(pipeFds[1], STDERR_FILENO);
-        close(pipeFds[0]);
         _exit(body());
     }
-    close(pipeFds[1]);
-    std::string error;
-    char buffer[256];
-    ssize_t got;
-    while ((got = read(pipeFds[0], buffer, sizeof buffer)) > 0 || (got < 0 && errno == EINTR)) {
-        if (got > 0) error.append(buffer, size_t(got));
-    }
-    close(pipeFds[0]);
-    return {waitStatus(pid), error};
-}
-
-inline int runInChild(const std::function<int()> &body, unsigned seconds) {
-    return runInChildCapturingStderr(body, seconds).status;
+    return waitStatus(pid);
 }
 
 /* The class word stored below a block. */
