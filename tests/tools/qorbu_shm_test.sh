@@ -2,7 +2,12 @@
 # qorbu-shm, driven as a script would drive it: outputs, exit codes and the
 # one-line errors. Usage: qorbu_shm_test.sh CASE QORBU_SHM SHM_POKE DATA_ADDRESS
 set -u
-CASE=$1 TOOL=$2 POKE=$3 ADDRESS=$4
+CASE=$1 TOOL_BIN=$2 POKE_BIN=$3 ADDRESS=$4
+# Cross builds run the programs under their emulator (QORBU_TEST_EMULATOR).
+EMULATOR=(${QORBU_TEST_EMULATOR:-})
+tool() { "${EMULATOR[@]}" "$TOOL_BIN" "$@"; }
+poke() { "${EMULATOR[@]}" "$POKE_BIN" "$@"; }
+TOOL=tool POKE=poke
 NAME=qorbu-shm-test-$CASE-$$
 FAILURES=0
 OUT=$(mktemp) ERR=$(mktemp)
