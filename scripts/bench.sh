@@ -30,6 +30,7 @@ if ((${#missing[@]})); then
 fi
 
 start=$(date +%s)
+load=$(cut -d' ' -f1-3 /proc/loadavg)
 cmake -S "$root" -B "$build" -G Ninja -DCMAKE_BUILD_TYPE=Release \
   -DQORBU_BUILD_TESTS=OFF -DQORBU_BUILD_EXAMPLES=OFF >/dev/null
 # A driver whose library part is missing or broken is reported and skipped.
@@ -78,7 +79,9 @@ Every figure below was measured in one run of \`bash scripts/bench.sh\` (Release
 7 repetitions runs every contender once, starting with a different one each time, and the table
 shows the median. Each cell is the median cost of one operation in nanoseconds and, in brackets,
 its ratio to the best peer of that row (below 1.00x: faster than every peer). The floors are not
-peers: they show what the system calls or the C library alone cost.
+peers: they show what the system calls or the C library alone cost. Samples are timed on the
+thread's CPU-time clock, so time spent descheduled by other load on the machine is not counted;
+the two-process figures are wall-clock, since waiting for the other process is part of them.
 
 Sources: \`bench/peers/\` (one driver per workload, \`harness.h\` for the interleaving, medians,
 tables and plots). The subsystems' own Google Benchmark programs (\`bench/*_bench.cpp\`) are built
@@ -95,7 +98,7 @@ machine move by 10-20 % from run to run; ratios within one row move much less.
 
 ## Machine
 
-    $(nproc) CPUs online (nproc); $(uname -srmo)
+    $(nproc) CPUs online (nproc); $(uname -srmo); load average at the start: $load
 $(lscpu | grep -E '^(Model name|Architecture|CPU\(s\)|Thread|Core|Socket|CPU max MHz|L1d|L2|L3|Hypervisor)' | sed 's/^/    /')
     compiler: $(c++ --version | head -1)
     peers (Debian packages):
