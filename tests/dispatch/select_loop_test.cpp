@@ -179,7 +179,6 @@ TEST_F(SelectPass, NegativeSnmpTimeoutIsReportedZeroedAndServiced) {
 }
 
 TEST_F(SelectPass, WithoutAnyTimeoutSourceTheWaitLastsUntilADescriptorIsReady) {
-    SKIP_IF_NO_FORK_OR_THREADS();
     ASSERT_EQ(SelRemoveAllTimers(), 1); /* the reaper's */
     Pipe p(40);
     ASSERT_EQ(SelAddFD(p.r, SEL_READ, 0, log_callback, nullptr), 0);
@@ -406,7 +405,6 @@ TEST_F(SelectSignals, RegisteredSignalIsDeliveredOnlyDuringTheBlockingWait) {
 /* --- wait failures --------------------------------------------------------- */
 
 TEST_F(SelectFailures, ClosedDescriptorIsNamedWithItsCallbackThenAborts) {
-    SKIP_IF_NO_FORK_OR_THREADS();
     Pipe registered(40), hostOnly(50), healthy(42);
     ASSERT_EQ(SelAddFD(registered.r, SEL_READ, 0, log_callback, nullptr), 0);
     ASSERT_EQ(SelAddFD(healthy.r, SEL_READ, 0, log_callback, nullptr), 0);
@@ -450,12 +448,10 @@ TEST_F(SelectFailures, EinvalWaitsReturnWithDiagnosticUntilTheFifthAborts) {
         EXPECT_EQ(std::count(err.begin(), err.end(), '\n'), 2 + 64);
     }
     EXPECT_EQ(scripted::host().counts.snmpTimeout, 0);
-    SKIP_IF_NO_FORK_OR_THREADS();
     EXPECT_DEATH(SelSelect(), literal_regex("SelSelect(): [p]select() failed: Invalid argument\n"));
 }
 
 TEST_F(SelectFailures, EinvalCountIsSharedByAllThreads) {
-    SKIP_IF_NO_FORK_OR_THREADS();
     scripted::host().snmp.giveTimeout = true;
     scripted::host().snmp.timeout = {0, 1500000};
     qorbu::sel::sel_einval_count.store(0);
