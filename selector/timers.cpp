@@ -100,6 +100,19 @@ inline void prefetch_grandchildren(SelTimer *const *heap, uint32_t left, uint32_
 
 bool is_due(const SelTimer *t, const struct timespec &now) { return !SelTimerBefore(&now, &t->when); }
 
+// Whether the timer is due by the clock as it reads now. A reading taken
+// before the last callback serves as long as it already shows the timer due:
+// the monotonic clock never goes back. Only otherwise is the clock read again.
+bool due_by_clock(const SelTimer *t, struct timespec &now, bool &fresh) {
+    if (is_due(t, now))
+        return true;
+    if (fresh)
+        return false;
+    SelGetTime(&now);
+    fresh = true;
+    return is_due(t, now);
+}
+
 } // namespace
 
 extern "C" {
@@ -212,10 +225,11 @@ int SelSleep(SelTimer *t, unsigned int ms) {
 int SelRunTimers(SelContext *ctx) {
     struct timespec now;
     SelGetTime(&now);
+    bool fresh = true;
     int fired = 0;
     for (;;) {
         SelTimer *top = ctx->timerHeap[1];
-        if (top == nullptr || !is_due(top, now))
+        if (top == nullptr || !due_by_clock(top, now, fresh))
             break;
         ctx->timerHeap[0] = top;
         remove_timer(ctx, top);
@@ -224,7 +238,7 @@ int SelRunTimers(SelContext *ctx) {
             callback(top);
         if (++fired == kMaxTimersPerRun)
             break;
-        SelGetTime(&now);
+        fresh = false;
     }
     return fired;
 }

@@ -78,6 +78,7 @@ bool SegmentLock::lockMutex() {
         // The holder died. Inside an allocation or free it left busy at 1,
         // which the caller's busy test then reports; elsewhere it lost nothing.
         err = pthread_mutex_consistent(&handle_->base->mutex);
+        if (err != 0) pthread_mutex_unlock(&handle_->base->mutex);
     }
     if (err != 0) {
         error_ = err;
