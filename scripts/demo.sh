@@ -22,5 +22,5 @@ if [ ! -x "$demo" ]; then
     cmake --preset default 2>&1 | grep -E 'qorbu-(demo|shm):' >&2
     exit 1
 fi
-echo "=== $demo --self-test $* ==="
+echo "=== $demo --self-test${*:+ $*} ==="
 exec "$demo" --self-test "$@"

@@ -142,7 +142,6 @@ TEST_F(HostSchedTest, WatchedDescriptorQueuesItsTaskWhileReadable)
     close(fds[1]);
 }
 
-#ifdef QORBU_DEMO_TEST_LOOP
 // The scheduler handed to the selector: one SelSelect pass runs what the
 // host queued, and a due timed task or a readable host descriptor ends the
 // pass's wait.
@@ -201,6 +200,5 @@ TEST_F(HostSchedLoopTest, ReadableHostDescriptorIsServicedAtTheEndOfThePass)
     close(fds[0]);
     close(fds[1]);
 }
-#endif
 
 } // namespace
