@@ -1,13 +1,9 @@
 // This binary is linked with an executable stack: green-thread stacks must
 // then be executable too, as the loader makes every other stack.
-#include <gtest/gtest.h>
-
-#include "greenthreads/greenthread_private.h"
 #include "gt_test_support.h"
-#include "support/test_support.h"
 
 using namespace qorbu::gt;
-using qorbu::test::mapping_at;
+using namespace qorbu::test;
 
 namespace {
 
@@ -21,7 +17,7 @@ TEST(ExecutableStackProcess, GreenThreadStacksAreExecutableToo)
                        nullptr);
     greenthreads_run();
     ASSERT_NE(stackBase, nullptr);
-    EXPECT_TRUE(qorbu::test::is_inaccessible(mapping_at(stackBase), qorbu::test::kEmulated));
+    EXPECT_TRUE(is_inaccessible(mapping_at(stackBase)));
     EXPECT_EQ(mapping_at(stackBase + page_size).perms, "rwxp");
 }
 

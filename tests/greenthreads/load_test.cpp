@@ -2,40 +2,21 @@
 // many concurrent client green threads, all in this one OS thread; every
 // byte that comes back is checked.
 #include <netinet/tcp.h>
-#include <poll.h>
 
 #include <memory>
 #include <vector>
 
-#include "nb_test_support.h"
-#include "support/test_support.h"
+#include "gt_test_support.h"
 
 using namespace qorbu::gt;
 using namespace qorbu::test;
 
 namespace {
 
-constexpr size_t kMaxMessage = 16 * 1024;
-
-/* Per-client generator: cheap, deterministic, independent of the others. */
-struct XorShift {
-    uint32_t state;
-    uint32_t next()
-    {
-        state ^= state << 13;
-        state ^= state >> 17;
-        state ^= state << 5;
-        return state;
-    }
-};
+constexpr size_t kMaxMessage = 16 * 1024; // buffers live on the heap: stacks are 16 KiB too
 
 struct EchoServer {
-    int listener = -1;
-    int expected = 0;
-    int accepted = 0;
-    int acceptErrors = 0;
-    int echoErrors = 0;
-    int connectionsDone = 0;
+    int listener, expected, accepted = 0, acceptErrors = 0, echoErrors = 0, connectionsDone = 0;
 };
 
 struct Connection {
@@ -54,14 +35,11 @@ void send_at_once(int fd)
 void echo_connection(void *arg)
 {
     std::unique_ptr<Connection> conn(static_cast<Connection *>(arg));
-    std::unique_ptr<unsigned char[]> buffer(new unsigned char[kMaxMessage]);
+    std::vector<unsigned char> buffer(kMaxMessage);
     set_nonblocking(conn->fd);
     send_at_once(conn->fd);
-    for (;;) {
-        const int n = nb_read(conn->fd, buffer.get(), kMaxMessage);
-        if (n == 0)
-            break;
-        if (n < 0 || nb_write(conn->fd, buffer.get(), static_cast<size_t>(n)) != n) {
+    for (int n; (n = nb_read(conn->fd, buffer.data(), kMaxMessage)) != 0;) {
+        if (n < 0 || nb_write(conn->fd, buffer.data(), static_cast<size_t>(n)) != n) {
             ++conn->server->echoErrors;
             break;
         }
@@ -86,45 +64,39 @@ void accept_connections(void *arg)
 }
 
 struct Client {
-    Client(const sockaddr_in *a, int m, uint32_t s) : address(a), messages(m), seed(s) {}
     const sockaddr_in *address;
     int messages;
-    uint32_t seed;
-    int echoed = 0;       // messages that came back intact
-    size_t bytes = 0;     // bytes checked
-    int failures = 0;
-    std::vector<unsigned char> out, in;
+    uint32_t random; // xorshift state: deterministic, independent of the other clients
+    int echoed = 0;  // messages that came back intact
+    size_t bytes = 0;
+    bool failed = false;
+    uint32_t next()
+    {
+        random ^= random << 13;
+        random ^= random >> 17;
+        random ^= random << 5;
+        return random;
+    }
 };
 
 void run_client(void *arg)
 {
     auto *client = static_cast<Client *>(arg);
-    client->out.resize(kMaxMessage);
-    client->in.resize(kMaxMessage);
-    XorShift random{client->seed};
-    const int fd = socket(AF_INET, SOCK_STREAM, 0);
-    set_nonblocking(fd);
+    std::vector<unsigned char> out(kMaxMessage), in(kMaxMessage);
+    const int fd = tcp_socket();
     send_at_once(fd);
-    if (nb_connect(fd, reinterpret_cast<const sockaddr *>(client->address), sizeof *client->address) != 0) {
-        ++client->failures;
-        close(fd);
-        return;
-    }
-    for (int m = 0; m < client->messages; ++m) {
-        const size_t size = 1 + random.next() % kMaxMessage;
+    client->failed = nb_connect(fd, reinterpret_cast<const sockaddr *>(client->address), sizeof *client->address) != 0;
+    for (int m = 0; m < client->messages && !client->failed; ++m) {
+        const size_t size = 1 + client->next() % kMaxMessage;
         for (size_t i = 0; i < size; ++i)
-            client->out[i] = static_cast<unsigned char>(random.next());
-        if (nb_write(fd, client->out.data(), size) != static_cast<int>(size) ||
-            nb_readall(fd, client->in.data(), size) != static_cast<int>(size)) {
-            ++client->failures;
-            break;
+            out[i] = static_cast<unsigned char>(client->next());
+        client->failed = nb_write(fd, out.data(), size) != static_cast<int>(size) ||
+                         nb_readall(fd, in.data(), size) != static_cast<int>(size) ||
+                         memcmp(out.data(), in.data(), size) != 0;
+        if (!client->failed) {
+            ++client->echoed;
+            client->bytes += size;
         }
-        if (memcmp(client->out.data(), client->in.data(), size) != 0) {
-            ++client->failures;
-            break;
-        }
-        ++client->echoed;
-        client->bytes += size;
     }
     close(fd);
 }
@@ -133,15 +105,13 @@ void run_echo_load(int connections, int messages)
 {
     Listener listener(4096);
     ASSERT_GE(listener.fd, 0);
-    EchoServer server;
-    server.listener = listener.fd;
-    server.expected = connections;
+    EchoServer server{listener.fd, connections};
     ASSERT_NE(greenthread_create(accept_connections, &server), nullptr);
-
-    std::vector<std::unique_ptr<Client>> clients;
+    std::vector<Client> clients;
+    clients.reserve(static_cast<size_t>(connections));
     for (int i = 0; i < connections; ++i) {
-        clients.emplace_back(new Client(&listener.addr, messages, 0x9e3779b9u + static_cast<uint32_t>(i) * 7919u));
-        ASSERT_NE(greenthread_create(run_client, clients.back().get()), nullptr);
+        clients.push_back(Client{&listener.addr, messages, 0x9e3779b9u + static_cast<uint32_t>(i) * 7919u});
+        ASSERT_NE(greenthread_create(run_client, &clients.back()), nullptr);
     }
     greenthreads_run();
 
@@ -151,10 +121,10 @@ void run_echo_load(int connections, int messages)
     EXPECT_EQ(server.connectionsDone, connections);
     int failures = 0, incomplete = 0;
     size_t bytes = 0;
-    for (const auto &client : clients) {
-        failures += client->failures;
-        incomplete += client->echoed != messages;
-        bytes += client->bytes;
+    for (const Client &client : clients) {
+        failures += client.failed;
+        incomplete += client.echoed != messages;
+        bytes += client.bytes;
     }
     EXPECT_EQ(failures, 0);
     EXPECT_EQ(incomplete, 0) << "clients that did not get every message back";

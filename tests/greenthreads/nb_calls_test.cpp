@@ -4,13 +4,12 @@
 #include <poll.h>
 #include <signal.h>
 #include <stdlib.h>
-#include <string.h>
 #include <sys/time.h>
 
 #include <algorithm>
 #include <vector>
 
-#include "nb_test_support.h"
+#include "gt_test_support.h"
 
 using namespace qorbu::gt;
 using namespace qorbu::test;
@@ -21,80 +20,55 @@ using NbCalls = GreenIo;
 
 int ignore_event(int, unsigned, void *, SelFdEntry *) { return 0; }
 
-TEST_F(NbCalls, ReadAtEndOfFileReturnsZeroWithoutWaiting)
-{
-    SocketPair pair;
-    pair.close_end(1);
-    // A wait would fail on this registration: the call must not wait.
-    ASSERT_EQ(SelAddFD(pair.fd[0], SEL_READ, 0, ignore_event, nullptr), 0);
-    int result = -2;
-    char buf[16];
-    auto reader = [&] { result = nb_read(pair.fd[0], buf, sizeof buf); };
-    spawn(&reader);
-    greenthreads_run();
-    EXPECT_EQ(result, 0);
-    SelRemFD(pair.fd[0]);
-}
+/* Sleeps in the selector: a wait on no event ends with its time-out. */
+void sleep_ms(int ms) { nb_poll(-1, 0, ms); }
 
-TEST_F(NbCalls, ReadWaitsForDataAndReturnsAShortCount)
+TEST_F(NbCalls, ReadsWaitReturnShortCountsAndStopAtEndOfFile)
 {
+    int readall = -2, written = -2;
+    auto nothing = [&] {
+        readall = nb_readall(-1, nullptr, 0);
+        written = nb_write(-1, nullptr, 0);
+    };
+    run_threads(nothing);
+    EXPECT_EQ(readall, 0) << "a zero-length call made a system call on descriptor -1";
+    EXPECT_EQ(written, 0);
+
     SocketPair pair;
-    int result = 0;
-    bool writerRan = false;
     char buf[100] = {};
-    auto reader = [&] { result = nb_read(pair.fd[0], buf, sizeof buf); };
-    auto writer = [&] {
-        writerRan = true;
-        (void)write(pair.fd[1], "0123456789", 10);
-    };
-    spawn(&reader);
-    spawn(&writer);
-    greenthreads_run();
-    EXPECT_TRUE(writerRan);
-    EXPECT_EQ(result, 10);
-    EXPECT_EQ(memcmp(buf, "0123456789", 10), 0);
+    int shortRead = 0, whole = 0, rest = 0;
+    auto shortReader = [&] { shortRead = nb_read(pair.fd[0], buf, sizeof buf); };
+    auto digits = [&] { (void)write(pair.fd[1], "0123456789", 10); };
+    run_threads(shortReader, digits);
+    EXPECT_EQ(shortRead, 10);
+    EXPECT_EQ(std::string(buf, 10), "0123456789");
     expect_nothing_left(pair.fd[0]);
-}
 
-TEST_F(NbCalls, ReadallGathersSeveralWritesAndStopsAtEndOfFile)
-{
-    SocketPair pair;
-    std::vector<char> buf(100, 0);
-    int whole = 0, shortRead = 0;
     auto reader = [&] {
-        whole = nb_readall(pair.fd[0], buf.data(), 30);
-        shortRead = nb_readall(pair.fd[0], buf.data() + 30, 70);
+        whole = nb_readall(pair.fd[0], buf, 30);
+        rest = nb_readall(pair.fd[0], buf + 30, 70);
     };
-    auto writer = [&] {
-        for (int chunk = 0; chunk < 4; ++chunk) {
-            char bytes[10];
-            memset(bytes, 'a' + chunk, sizeof bytes);
-            (void)write(pair.fd[1], bytes, sizeof bytes);
+    auto chunks = [&] {
+        for (char c = 'a'; c <= 'd'; ++c) {
+            (void)write(pair.fd[1], std::string(10, c).data(), 10);
             sleep_ms(5); // lets the selector wake the reader between chunks
         }
         pair.close_end(1);
     };
-    spawn(&reader);
-    spawn(&writer);
-    greenthreads_run();
+    run_threads(reader, chunks);
     EXPECT_EQ(whole, 30);
-    EXPECT_EQ(shortRead, 10) << "the peer sent 10 of the 70 wanted bytes, then closed";
-    EXPECT_EQ(std::string(buf.data(), 40), std::string(10, 'a') + std::string(10, 'b') + std::string(10, 'c') +
-                                              std::string(10, 'd'));
+    EXPECT_EQ(rest, 10) << "the peer sent 10 of the 70 wanted bytes, then closed";
+    EXPECT_EQ(std::string(buf, 40), std::string(10, 'a') + std::string(10, 'b') + std::string(10, 'c') +
+                                        std::string(10, 'd'));
     expect_nothing_left(pair.fd[0]);
-}
 
-TEST_F(NbCalls, ZeroLengthReadallAndWriteMakeNoSystemCall)
-{
-    int readall = -2, written = -2;
-    auto caller = [&] {
-        readall = nb_readall(-1, nullptr, 0);
-        written = nb_write(-1, nullptr, 0);
-    };
-    spawn(&caller);
-    greenthreads_run();
-    EXPECT_EQ(readall, 0) << "a read on descriptor -1 would have failed";
-    EXPECT_EQ(written, 0);
+    // A wait would fail on this registration: at end of file no wait is made.
+    ASSERT_EQ(SelAddFD(pair.fd[0], SEL_READ, 0, ignore_event, nullptr), 0);
+    int atEnd = -2;
+    auto endReader = [&] { atEnd = nb_read(pair.fd[0], buf, sizeof buf); };
+    run_threads(endReader);
+    EXPECT_EQ(atEnd, 0);
+    SelRemFD(pair.fd[0]);
 }
 
 TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
@@ -123,9 +97,7 @@ TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
             greenthread_yield();
         }
     };
-    spawn(&writer);
-    spawn(&reader);
-    greenthreads_run();
+    run_threads(writer, reader);
     EXPECT_EQ(written, static_cast<int>(total));
     EXPECT_EQ(received, total);
     EXPECT_GT(receivedWhenWriterReturned, 0u) << "the writer never waited for the reader";
@@ -134,12 +106,14 @@ TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
     expect_nothing_left(pair.fd[1]);
 }
 
-TEST_F(NbCalls, AcceptWaitsForAConnectionThatConnectCompletes)
+TEST_F(NbCalls, AcceptAndConnectWaitForEachOtherAndARefusalIsReported)
 {
-    Listener listener;
+    Listener listener, bound(0, false); // bound, never listening: connections are refused
     ASSERT_GE(listener.fd, 0);
-    const int client = tcp_socket();
+    ASSERT_GE(bound.fd, 0);
+    const int client = tcp_socket(), refusedClient = tcp_socket();
     int accepted = -2, connected = -2;
+    Outcome refused;
     char received = 0;
     auto server = [&] {
         accepted = nb_accept(listener.fd, nullptr, nullptr);
@@ -151,39 +125,21 @@ TEST_F(NbCalls, AcceptWaitsForAConnectionThatConnectCompletes)
     auto connector = [&] {
         connected = nb_connect(client, listener.address(), sizeof listener.addr);
         nb_write(client, "k", 1);
+        refused = with_errno(nb_connect(refusedClient, bound.address(), sizeof bound.addr));
     };
-    spawn(&server);
-    spawn(&connector);
-    greenthreads_run();
+    run_threads(server, connector);
     EXPECT_GE(accepted, 0);
     EXPECT_EQ(connected, 0);
     EXPECT_EQ(received, 'k');
-    expect_nothing_left(listener.fd);
-    expect_nothing_left(client);
+    EXPECT_EQ(refused, failure(ECONNREFUSED));
+    for (int fd : {listener.fd, client, refusedClient})
+        expect_nothing_left(fd);
     close(client);
+    close(refusedClient);
     if (accepted >= 0)
         close(accepted);
 }
 
-TEST_F(NbCalls, ConnectionRefusedIsReportedOnceTheAttemptCompletes)
-{
-    Listener bound(0, false); // bound, never listening: connections are refused
-    ASSERT_GE(bound.fd, 0);
-    const int client = tcp_socket();
-    int result = 0, error = 0;
-    auto connector = [&] {
-        result = nb_connect(client, bound.address(), sizeof bound.addr);
-        error = errno;
-    };
-    spawn(&connector);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_EQ(error, ECONNREFUSED);
-    expect_nothing_left(client);
-    close(client);
-}
-
-// ---------------------------------------------------------------------------
 // EINTR ends a call at once. The descriptors are left blocking so that the
 // system call itself sleeps until a signal interrupts it; should the call
 // retry, later signals rescue it so that the test fails instead of hanging.
@@ -210,105 +166,76 @@ protected:
     void SetUp() override
     {
         GreenIo::SetUp();
-        signalsSeen = 0;
         struct sigaction action = {};
         action.sa_handler = rescue_after_first_signal;
         action.sa_flags = 0; // no SA_RESTART: the system call fails with EINTR
         sigaction(SIGALRM, &action, &previous);
-        itimerval every = {{0, 50000}, {0, 50000}};
-        setitimer(ITIMER_REAL, &every, nullptr);
     }
-    void TearDown() override
+    void TearDown() override { sigaction(SIGALRM, &previous, nullptr); }
+    template <typename Call>
+    void expect_eintr_without_retry(Call call)
     {
-        itimerval off = {};
+        signalsSeen = 0;
+        Outcome outcome;
+        auto caller = [&] { outcome = with_errno(call()); };
+        itimerval every = {{0, 50000}, {0, 50000}}, off = {};
+        setitimer(ITIMER_REAL, &every, nullptr);
+        run_threads(caller);
         setitimer(ITIMER_REAL, &off, nullptr);
-        sigaction(SIGALRM, &previous, nullptr);
+        EXPECT_EQ(outcome, failure(EINTR));
     }
     struct sigaction previous = {};
 };
 
-TEST_F(Interrupted, ReadReturnsEintrWithoutRetrying)
+TEST_F(Interrupted, ReadAndAcceptReturnEintrWithoutRetrying)
 {
     int fds[2];
     ASSERT_EQ(pipe(fds), 0); // blocking
     rescueFd = fds[1];
     rescueAddress = nullptr;
-    int result = 0, error = 0;
     char byte;
-    auto reader = [&] {
-        result = nb_read(fds[0], &byte, 1);
-        error = errno;
-    };
-    spawn(&reader);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_EQ(error, EINTR);
+    expect_eintr_without_retry([&] { return nb_read(fds[0], &byte, 1); });
     close(fds[0]);
     close(fds[1]);
-}
 
-TEST_F(Interrupted, AcceptReturnsEintrWithoutRetrying)
-{
     Listener listener;
     ASSERT_GE(listener.fd, 0);
     fcntl(listener.fd, F_SETFL, fcntl(listener.fd, F_GETFL) & ~O_NONBLOCK);
     rescueAddress = &listener.addr;
-    int result = 0, error = 0;
-    auto server = [&] {
-        result = nb_accept(listener.fd, nullptr, nullptr);
-        error = errno;
-    };
-    spawn(&server);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_EQ(error, EINTR);
+    expect_eintr_without_retry([&] { return nb_accept(listener.fd, nullptr, nullptr); });
 }
 
-// ---------------------------------------------------------------------------
 // A descriptor the selector refuses makes every call fail with the
 // registration's errno instead of retrying for ever.
-
 TEST_F(NbCalls, RefusedRegistrationEndsEveryCallWithItsErrno)
 {
     SocketPair empty, full;
     Listener listener;
     ASSERT_GE(listener.fd, 0);
     const int client = tcp_socket();
-    // Fill a send buffer so that a write would block.
     std::vector<char> filler(64 * 1024, 'f');
-    while (write(full.fd[1], filler.data(), filler.size()) > 0) {
+    while (write(full.fd[1], filler.data(), filler.size()) > 0) { // a write would now block
     }
-    for (int fd : {empty.fd[0], full.fd[1], listener.fd, client})
+    const int fds[] = {empty.fd[0], full.fd[1], listener.fd, client};
+    for (int fd : fds)
         ASSERT_EQ(SelAddFD(fd, SEL_EXCEPT, 0, ignore_event, nullptr), 0);
 
-    struct Outcome {
-        int result = 0, error = 0;
-    } read1, readall, write1, accept1, connect1;
+    Outcome reading, readingAll, writing, accepting, connecting;
     char buf[8];
     auto caller = [&] {
-        read1.result = nb_read(empty.fd[0], buf, sizeof buf);
-        read1.error = errno;
-        readall.result = nb_readall(empty.fd[0], buf, sizeof buf);
-        readall.error = errno;
-        write1.result = nb_write(full.fd[1], filler.data(), filler.size());
-        write1.error = errno;
-        accept1.result = nb_accept(listener.fd, nullptr, nullptr);
-        accept1.error = errno;
-        connect1.result = nb_connect(client, listener.address(), sizeof listener.addr);
-        connect1.error = errno;
+        reading = with_errno(nb_read(empty.fd[0], buf, sizeof buf));
+        readingAll = with_errno(nb_readall(empty.fd[0], buf, sizeof buf));
+        writing = with_errno(nb_write(full.fd[1], filler.data(), filler.size()));
+        accepting = with_errno(nb_accept(listener.fd, nullptr, nullptr));
+        connecting = with_errno(nb_connect(client, listener.address(), sizeof listener.addr));
     };
-    spawn(&caller);
-    greenthreads_run();
-    for (const Outcome &o : {read1, readall, write1, accept1}) {
-        EXPECT_EQ(o.result, -1);
-        EXPECT_EQ(o.error, EBUSY);
+    run_threads(caller);
+    for (const Outcome &o : {reading, readingAll, writing, accepting})
+        EXPECT_EQ(o, failure(EBUSY));
+    if (connecting.first != 0) { // a loopback connection may be established at once, without a wait
+        EXPECT_EQ(connecting, failure(EBUSY));
     }
-    // A loopback connection may be established at once, without a wait.
-    if (connect1.result != 0) {
-        EXPECT_EQ(connect1.result, -1);
-        EXPECT_EQ(connect1.error, EBUSY);
-    }
-    for (int fd : {empty.fd[0], full.fd[1], listener.fd, client}) {
+    for (int fd : fds) {
         EXPECT_EQ(registered_events(fd), SEL_EXCEPT) << "the other registration of " << fd << " was lost";
         SelRemFD(fd);
     }

@@ -2,7 +2,7 @@
 // descriptors the selector refuses, and clean-up on every return.
 #include <poll.h>
 
-#include "nb_test_support.h"
+#include "gt_test_support.h"
 
 using namespace qorbu::gt;
 using namespace qorbu::test;
@@ -11,20 +11,29 @@ namespace {
 
 using NbPoll = GreenIo;
 
-TEST_F(NbPoll, TimeoutExpiresAndLeavesNothingRegistered)
+TEST_F(NbPoll, NeitherInNorOutSleepsOrFailsAndTimeoutsExpire)
 {
     SocketPair pair;
-    int result = 0;
-    double elapsed = 0;
+    Outcome slept, refused, timedOut;
+    double sleptFor = 0, waitedFor = 0;
+    unsigned eventsWhileAsleep = 1;
     auto waiter = [&] {
-        const double start = seconds_now();
-        result = nb_poll(pair.fd[0], POLLIN, 50);
-        elapsed = seconds_now() - start;
+        double start = seconds_now();
+        slept = with_errno(nb_poll(pair.fd[0], POLLPRI, 20));
+        sleptFor = seconds_now() - start;
+        refused = with_errno(nb_poll(pair.fd[0], POLLPRI, 0));
+        start = seconds_now();
+        timedOut = with_errno(nb_poll(pair.fd[0], POLLIN, 50));
+        waitedFor = seconds_now() - start;
     };
-    spawn(&waiter);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_GE(elapsed, 0.050);
+    auto inspector = [&] { eventsWhileAsleep = registered_events(pair.fd[0]); };
+    run_threads(waiter, inspector);
+    EXPECT_EQ(slept.first, -1);
+    EXPECT_GE(sleptFor, 0.020);
+    EXPECT_EQ(eventsWhileAsleep, 0u);
+    EXPECT_EQ(refused, failure(EINVAL));
+    EXPECT_EQ(timedOut.first, -1);
+    EXPECT_GE(waitedFor, 0.050);
     expect_nothing_left(pair.fd[0]);
 }
 
@@ -37,58 +46,42 @@ SelTimer *find_wait_timer()
     return nullptr;
 }
 
-TEST_F(NbPoll, TimeoutIsArmedOnTheMonotonicClockAndReadinessEndsTheWait)
-{
-    SocketPair pair;
-    Greenthread *waiterThread = nullptr;
-    double start = 0;
-    int result = 0;
-    auto waiter = [&] {
-        struct timespec now;
-        SelGetTime(&now);
-        start = static_cast<double>(now.tv_sec) + static_cast<double>(now.tv_nsec) / 1e9;
-        result = nb_poll(pair.fd[0], POLLIN | POLLPRI, 1500);
-    };
-    double deadline = 0;
-    unsigned events = 0;
-    Greenthread *waitingThread = nullptr;
-    bool timerArmed = false;
-    auto inspector = [&] {
-        // Runs once the waiter has blocked.
-        SelTimer *timer = find_wait_timer();
-        if (timer != nullptr) {
-            deadline = static_cast<double>(timer->when.tv_sec) + static_cast<double>(timer->when.tv_nsec) / 1e9;
-            timerArmed = true;
-            waitingThread = static_cast<NbWait *>(timer->arg)->thread;
-        }
-        events = registered_events(pair.fd[0]);
-        (void)write(pair.fd[1], "x", 1);
-    };
-    waiterThread = spawn(&waiter);
-    spawn(&inspector);
-    greenthreads_run();
-    ASSERT_TRUE(timerArmed) << "no time-out timer was armed";
-    EXPECT_EQ(waitingThread, waiterThread);
-    EXPECT_GE(deadline - start, 1.5);
-    EXPECT_LT(deadline - start, 2.5);
-    EXPECT_EQ(events, SEL_READ) << "POLLPRI is not watched";
-    EXPECT_EQ(result, 1);
-    expect_nothing_left(pair.fd[0]);
-}
+double seconds_of(const timespec &t) { return static_cast<double>(t.tv_sec) + static_cast<double>(t.tv_nsec) / 1e9; }
 
-TEST_F(NbPoll, InAndOutRegistersBothAndEitherEndsTheWait)
+TEST_F(NbPoll, WatchesInAndOutOnlyArmsAMonotonicTimeoutAndReadinessEndsTheWait)
 {
-    SocketPair pair; // writable at once, never readable
-    unsigned events = 0;
-    int result = 0;
-    auto waiter = [&] { result = nb_poll(pair.fd[0], POLLIN | POLLOUT, 0); };
-    auto inspector = [&] { events = registered_events(pair.fd[0]); };
-    spawn(&waiter);
-    spawn(&inspector);
-    greenthreads_run();
-    EXPECT_EQ(events, SEL_READ | SEL_WRITE);
-    EXPECT_EQ(result, 1);
-    expect_nothing_left(pair.fd[0]);
+    const std::pair<int, unsigned> cases[] = {{POLLIN | POLLPRI, SEL_READ}, {POLLIN | POLLOUT, SEL_READ | SEL_WRITE}};
+    for (const auto &[pollEvents, watched] : cases) {
+        SCOPED_TRACE(pollEvents);
+        SocketPair pair; // writable at once, readable once the inspector writes
+        double start = 0, deadline = 0;
+        int result = 0;
+        unsigned events = 0;
+        Greenthread *waitingThread = nullptr;
+        auto waiter = [&] {
+            timespec now;
+            SelGetTime(&now);
+            start = seconds_of(now);
+            result = nb_poll(pair.fd[0], pollEvents, 1500);
+        };
+        auto inspector = [&] { // runs once the waiter has blocked
+            if (SelTimer *timer = find_wait_timer()) {
+                deadline = seconds_of(timer->when);
+                waitingThread = static_cast<NbWait *>(timer->arg)->thread;
+            }
+            events = registered_events(pair.fd[0]);
+            (void)write(pair.fd[1], "x", 1);
+        };
+        Greenthread *waiterThread = spawn(&waiter);
+        run_threads(inspector);
+        ASSERT_NE(waitingThread, nullptr) << "no time-out timer was armed";
+        EXPECT_EQ(waitingThread, waiterThread);
+        EXPECT_GE(deadline - start, 1.5);
+        EXPECT_LT(deadline - start, 2.5);
+        EXPECT_EQ(events, watched) << "only POLLIN and POLLOUT are watched";
+        EXPECT_EQ(result, 1);
+        expect_nothing_left(pair.fd[0]);
+    }
 }
 
 TEST_F(NbPoll, ReadinessWinsOverATimeoutDueInTheSamePass)
@@ -97,21 +90,15 @@ TEST_F(NbPoll, ReadinessWinsOverATimeoutDueInTheSamePass)
     ASSERT_EQ(write(pair.fd[1], "x", 1), 1); // ready before the wait starts
     int result = 0;
     auto waiter = [&] { result = nb_poll(pair.fd[0], POLLIN, 1); };
-    // Keeps the selector away until the waiter's 1 ms time-out is due.
-    auto busy = [] {
-        const double until = seconds_now() + 0.030;
-        while (seconds_now() < until) {
+    auto busy = [] { // keeps the selector away until the waiter's 1 ms time-out is due
+        for (const double until = seconds_now() + 0.030; seconds_now() < until;) {
         }
     };
-    spawn(&waiter);
-    spawn(&busy);
-    greenthreads_run();
+    run_threads(waiter, busy);
     EXPECT_EQ(result, 1);
     expect_nothing_left(pair.fd[0]);
-}
 
-TEST_F(NbPoll, CallbacksGiveReadinessPrecedenceInEitherOrder)
-{
+    // The callbacks themselves, in either order.
     NbWait wait = {current_greenthread(), 0};
     SelTimer timer = {};
     timer.arg = &wait;
@@ -123,148 +110,34 @@ TEST_F(NbPoll, CallbacksGiveReadinessPrecedenceInEitherOrder)
     EXPECT_EQ(wait.result, 1) << "a later time-out changes nothing";
 }
 
-TEST_F(NbPoll, WithoutTimeoutItWaitsWhileOtherThreadsRun)
+TEST_F(NbPoll, WithoutTimeoutItWaitsWhileOtherThreadsRunOrRunsTheLoopInTheMainContext)
 {
     SocketPair pair;
     std::string order;
-    int result = 0;
+    int result = 0, turns = 0;
     auto waiter = [&] {
         result = nb_poll(pair.fd[0], POLLIN, 0);
         order += 'W';
     };
     auto other = [&] {
-        for (int i = 0; i < 50; ++i) {
+        for (; turns < 50; ++turns) {
             order += 'o';
             greenthread_yield();
         }
         (void)write(pair.fd[1], "x", 1);
     };
-    spawn(&waiter);
-    spawn(&other);
-    greenthreads_run();
+    run_threads(waiter, other);
     EXPECT_EQ(order, std::string(50, 'o') + "W");
     EXPECT_EQ(result, 1);
     expect_nothing_left(pair.fd[0]);
-}
 
-TEST_F(NbPoll, NeitherInNorOutIsASleepWithATimeoutAndAnErrorWithout)
-{
-    SocketPair pair;
-    int slept = 0, refused = 0, refusedErrno = 0;
-    double elapsed = 0;
-    unsigned events = 1;
-    auto inspector = [&] { events = registered_events(pair.fd[0]); };
-    auto waiter = [&] {
-        const double start = seconds_now();
-        slept = nb_poll(pair.fd[0], POLLPRI, 20);
-        elapsed = seconds_now() - start;
-        refused = nb_poll(pair.fd[0], POLLPRI, 0);
-        refusedErrno = errno;
-    };
-    spawn(&waiter);
-    spawn(&inspector);
-    greenthreads_run();
-    EXPECT_EQ(slept, -1);
-    EXPECT_GE(elapsed, 0.020);
-    EXPECT_EQ(events, 0u);
-    EXPECT_EQ(refused, -1);
-    EXPECT_EQ(refusedErrno, EINVAL);
-    expect_nothing_left(pair.fd[0]);
-}
-
-// ---------------------------------------------------------------------------
-// Descriptors the selector refuses: the wait fails at once instead of
-// blocking for ever.
-
-TEST_F(NbPoll, InvalidDescriptorFailsAtOnce)
-{
-    int result = 0, error = 0;
-    auto waiter = [&] {
-        result = nb_poll(-1, POLLIN, 0);
-        error = errno;
-    };
-    spawn(&waiter);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_EQ(error, EINVAL);
-    EXPECT_EQ(armed_timers(), timersBefore);
-}
-
-int ignore_event(int, unsigned, void *, SelFdEntry *) { return 0; }
-
-TEST_F(NbPoll, DescriptorRegisteredElsewhereFailsWithEbusyAndKeepsTheOtherRegistration)
-{
-    SocketPair pair;
-    int marker = 0;
-    ASSERT_EQ(SelAddFD(pair.fd[0], SEL_READ, 0, ignore_event, &marker), 0);
-    int result = 0, error = 0;
-    auto waiter = [&] {
-        result = nb_poll(pair.fd[0], POLLIN, 100);
-        error = errno;
-    };
-    spawn(&waiter);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_EQ(error, EBUSY);
-    EXPECT_EQ(SelGetFDArg(pair.fd[0]), &marker);
-    EXPECT_EQ(armed_timers(), timersBefore) << "no timer is armed for a refused descriptor";
-    SelRemFD(pair.fd[0]);
-}
-
-TEST_F(NbPoll, DescriptorBeyondTheSelectRangeFailsInSelectMode)
-{
-    if (!raise_fd_limit(FD_SETSIZE + 16))
-        GTEST_SKIP() << "RLIMIT_NOFILE's hard limit is below " << FD_SETSIZE + 16;
-    SocketPair pair;
-    const int high = dup2(pair.fd[0], FD_SETSIZE + 8);
-    ASSERT_EQ(high, FD_SETSIZE + 8);
-    int result = 0, error = 0;
-    auto waiter = [&] {
-        result = nb_poll(high, POLLIN, 0);
-        error = errno;
-    };
-    spawn(&waiter);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_EQ(error, EINVAL);
-    close(high);
-}
-
-TEST_F(NbPoll, InEpollModeADescriptorEpollRefusesFailsAndLeavesNoEntry)
-{
-    if (!raise_fd_limit(FD_SETSIZE + 16))
-        GTEST_SKIP() << "RLIMIT_NOFILE's hard limit is below " << FD_SETSIZE + 16;
-    ASSERT_EQ(SelUseEpoll(), 0);
-    const int closed = FD_SETSIZE + 9; // not open
-    ASSERT_EQ(fcntl(closed, F_GETFD), -1);
-    int result = 0, error = 0;
-    auto waiter = [&] {
-        result = nb_poll(closed, POLLIN, 0);
-        error = errno;
-    };
-    spawn(&waiter);
-    greenthreads_run();
-    EXPECT_EQ(result, -1);
-    EXPECT_NE(error, 0);
-    EXPECT_EQ(registered_events(closed), 0u) << "a refused wait left its entry behind";
-    DeInitEpoll();
-}
-
-// ---------------------------------------------------------------------------
-// The main context may not block: there nb_poll drives the run loop itself.
-
-TEST_F(NbPoll, InTheMainContextItRunsTheLoopUntilReady)
-{
-    SocketPair pair;
-    int turns = 0;
-    auto writer = [&] {
-        for (; turns < 5; ++turns)
-            greenthread_yield();
-        (void)write(pair.fd[1], "x", 1);
-    };
-    spawn(&writer);
+    // The main context may not block: there nb_poll drives the run loop.
+    char byte;
+    ASSERT_EQ(read(pair.fd[0], &byte, 1), 1);
+    turns = 45;
+    spawn(&other);
     EXPECT_EQ(nb_poll(pair.fd[0], POLLIN, 0), 1);
-    EXPECT_EQ(turns, 5);
+    EXPECT_EQ(turns, 50);
     expect_nothing_left(pair.fd[0]);
     greenthreads_run();
 }
@@ -281,20 +154,56 @@ TEST(NbPollWithoutScheduler, WaitsInTheSelectorAlone)
     EXPECT_EQ(registered_events(pair.fd[0]), 0u);
 }
 
-// ---------------------------------------------------------------------------
-// Epoll mode: the run loop waits with epoll, so descriptors beyond the
-// select range work.
+// Descriptors the selector refuses: the wait fails at once with the
+// registration's errno instead of blocking for ever.
 
-TEST_F(NbPoll, InEpollModeDescriptorsBeyondTheSelectRangeWork)
+int ignore_event(int, unsigned, void *, SelFdEntry *) { return 0; }
+
+TEST_F(NbPoll, InvalidOrBusyDescriptorFailsAtOnceAndKeepsTheOtherRegistration)
 {
-    if (!raise_fd_limit(FD_SETSIZE + 16))
-        GTEST_SKIP() << "RLIMIT_NOFILE's hard limit is below " << FD_SETSIZE + 16;
-    ASSERT_EQ(SelUseEpoll(), 0);
+    SocketPair pair;
+    int marker = 0;
+    ASSERT_EQ(SelAddFD(pair.fd[0], SEL_READ, 0, ignore_event, &marker), 0);
+    Outcome invalid, busy;
+    auto waiter = [&] {
+        invalid = with_errno(nb_poll(-1, POLLIN, 0));
+        busy = with_errno(nb_poll(pair.fd[0], POLLIN, 100));
+    };
+    run_threads(waiter);
+    EXPECT_EQ(invalid, failure(EINVAL));
+    EXPECT_EQ(busy, failure(EBUSY));
+    EXPECT_EQ(SelGetFDArg(pair.fd[0]), &marker);
+    EXPECT_EQ(armed_timers(), timersBefore) << "no timer is armed for a refused descriptor";
+    SelRemFD(pair.fd[0]);
+}
+
+TEST_F(NbPoll, DescriptorBeyondTheSelectRangeFailsInSelectMode)
+{
+    SKIP_UNLESS_FD_LIMIT(FD_SETSIZE + 16);
     SocketPair pair;
     const int high = dup2(pair.fd[0], FD_SETSIZE + 8);
     ASSERT_EQ(high, FD_SETSIZE + 8);
+    Outcome result;
+    auto waiter = [&] { result = with_errno(nb_poll(high, POLLIN, 0)); };
+    run_threads(waiter);
+    EXPECT_EQ(result, failure(EINVAL));
+    close(high);
+}
+
+// In epoll mode the run loop waits with epoll: descriptors beyond the select
+// range work, and one that epoll refuses fails without leaving an entry.
+TEST_F(NbPoll, InEpollModeDescriptorsBeyondTheSelectRangeWorkAndRefusedOnesFail)
+{
+    SKIP_UNLESS_FD_LIMIT(FD_SETSIZE + 16);
+    ASSERT_EQ(SelUseEpoll(), 0);
+    SocketPair pair;
+    const int high = dup2(pair.fd[0], FD_SETSIZE + 8), closed = FD_SETSIZE + 9;
+    ASSERT_EQ(high, FD_SETSIZE + 8);
+    ASSERT_EQ(fcntl(closed, F_GETFD), -1);
     int result = 0, timedOut = 0;
+    Outcome refused;
     auto waiter = [&] {
+        refused = with_errno(nb_poll(closed, POLLIN, 0));
         timedOut = nb_poll(high, POLLIN, 20);
         result = nb_poll(high, POLLIN, 0);
     };
@@ -302,13 +211,13 @@ TEST_F(NbPoll, InEpollModeDescriptorsBeyondTheSelectRangeWork)
         nb_poll(pair.fd[1], 0, 60); // nothing watched: a plain sleep
         (void)write(pair.fd[1], "x", 1);
     };
-    spawn(&waiter);
-    spawn(&writer);
-    greenthreads_run();
+    run_threads(waiter, writer);
+    EXPECT_EQ(refused.first, -1);
+    EXPECT_NE(refused.second, 0);
+    EXPECT_EQ(registered_events(closed), 0u) << "a refused wait left its entry behind";
     EXPECT_EQ(timedOut, -1);
     EXPECT_EQ(result, 1);
-    EXPECT_EQ(registered_events(high), 0u);
-    EXPECT_EQ(armed_timers(), timersBefore);
+    expect_nothing_left(high);
     close(high);
     DeInitEpoll();
 }

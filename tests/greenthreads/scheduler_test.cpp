@@ -1,12 +1,6 @@
 // The run queue, yield/block/wakeup, record reuse and the run loop. Every
 // test case runs in a fresh process, so each starts with a fresh scheduler.
-#include <gtest/gtest.h>
-
-#include <string>
-#include <vector>
-
-#include "greenthreads/greenthread_private.h"
-#include "selector/sel_private.h"
+#include "gt_test_support.h"
 
 using namespace qorbu::gt;
 
@@ -38,14 +32,12 @@ void yield_in_loop(void *arg)
 
 void do_nothing(void *) {}
 
-class Scheduler : public ::testing::Test {
+class Scheduler : public qorbu::test::GreenIo {
 protected:
     void SetUp() override
     {
         trace.clear();
-        ASSERT_EQ(SelInit(), 0);
-        greenthreads_init();
-        ASSERT_NE(current_greenthread(), nullptr);
+        GreenIo::SetUp();
     }
 };
 
@@ -59,70 +51,48 @@ TEST_F(Scheduler, QueueIsFifoAndTheMainContextTakesOneTurnPerPass)
         greenthread_yield();
     }
     EXPECT_EQ(trace, "MABMABMABM");
-}
 
-TEST_F(Scheduler, NewThreadWaitsForItsCreatorAndGetsItsArgument)
-{
-    static void *received;
-    static bool ran;
-    received = nullptr;
-    ran = false;
-    int token = 0;
+    trace.clear(); // threads that create threads
     greenthread_create(
-        [](void *arg) {
-            ran = true;
-            received = arg;
+        [](void *) {
+            trace += '1';
+            greenthread_create([](void *) { trace += '3'; }, nullptr);
+            greenthread_yield();
+            trace += '4';
         },
-        &token);
-    EXPECT_FALSE(ran);
-    EXPECT_EQ(live_threads, 1);
-    EXPECT_EQ(queue_length(), 1);
+        nullptr);
+    greenthread_create([](void *) { trace += '2'; }, nullptr);
     greenthreads_run();
-    EXPECT_TRUE(ran);
-    EXPECT_EQ(received, &token);
-    EXPECT_EQ(live_threads, 0);
+    EXPECT_EQ(trace, "1234");
 }
 
-TEST_F(Scheduler, YieldWithNothingElseQueuedReturnsAtOnce)
-{
-    greenthread_yield();
-    EXPECT_EQ(current_greenthread(), main_thread);
-    EXPECT_EQ(run_queue_head, nullptr);
-    EXPECT_EQ(run_queue_tail, nullptr);
-}
-
-TEST_F(Scheduler, FinishedRecordIsReusedWithItsStackAndStartsAfresh)
+TEST_F(Scheduler, FinishedRecordsAreReusedNewestFirstWithTheirStacks)
 {
     static void *stackMark;
-    static int runs;
-    runs = 0;
     auto markStack = [](void *arg) {
         stackMark = __builtin_frame_address(0);
         *static_cast<int *>(arg) += 1;
-        ++runs;
     };
     int first = 0, second = 0;
     Greenthread *t1 = greenthread_create(markStack, &first);
-    greenthreads_run();
-    void *firstMark = stackMark;
-    EXPECT_EQ(free_threads, t1);
-
-    Greenthread *t2 = greenthread_create(markStack, &second);
-    EXPECT_EQ(t2, t1);
-    EXPECT_EQ(free_threads, nullptr);
+    EXPECT_EQ(first, 0) << "a new thread waits for its creator";
     EXPECT_EQ(live_threads, 1);
+    EXPECT_EQ(queue_length(), 1);
     greenthreads_run();
-    EXPECT_EQ(stackMark, firstMark) << "a reused record restarts at the top of the same stack";
+    EXPECT_EQ(live_threads, 0);
+    EXPECT_EQ(free_threads, t1);
+    void *firstMark = stackMark;
+
+    EXPECT_EQ(greenthread_create(markStack, &second), t1);
+    EXPECT_EQ(free_threads, nullptr);
+    greenthreads_run();
     EXPECT_EQ(first, 1);
     EXPECT_EQ(second, 1);
-    EXPECT_EQ(runs, 2);
+    EXPECT_EQ(stackMark, firstMark) << "a reused record restarts at the top of the same stack";
     char *base = static_cast<char *>(t1->context.uc_stack.ss_sp);
     EXPECT_GT(static_cast<char *>(stackMark), base + page_size);
     EXPECT_LT(static_cast<char *>(stackMark), base + t1->context.uc_stack.ss_size);
-}
 
-TEST_F(Scheduler, NewestFinishedRecordIsReusedFirst)
-{
     Yielder quick{'A', 1}, slow{'B', 2};
     Greenthread *a = greenthread_create(yield_in_loop, &quick);
     Greenthread *b = greenthread_create(yield_in_loop, &slow);
@@ -139,17 +109,17 @@ TEST_F(Scheduler, NewestFinishedRecordIsReusedFirst)
     EXPECT_EQ(live_threads, 0);
 }
 
-TEST_F(Scheduler, WakeupOfRunningQueuedOrMainRecordChangesNothing)
+TEST_F(Scheduler, WakeupQueuesOnlyABlockedThreadAndOnlyOnce)
 {
+    // Running, queued and main records are left as they are.
     static Greenthread *other;
-    static int queuedAfterSelfWake;
-    static int queuedAfterMainWake;
+    static int queuedAfterSelfWake, queuedAfterOtherWakes;
     auto waker = [](void *) {
         greenthread_wakeup(current_greenthread());
         queuedAfterSelfWake = queue_length();
         greenthread_wakeup(main_thread); // the main context is queued here
         greenthread_wakeup(other);       // and so is the other thread
-        queuedAfterMainWake = queue_length();
+        queuedAfterOtherWakes = queue_length();
     };
     Yielder y{'O', 1};
     greenthread_create(waker, nullptr);
@@ -158,14 +128,10 @@ TEST_F(Scheduler, WakeupOfRunningQueuedOrMainRecordChangesNothing)
     EXPECT_EQ(queue_length(), 2);
     greenthreads_run();
     EXPECT_EQ(queuedAfterSelfWake, 2); // the other thread and the main context
-    EXPECT_EQ(queuedAfterMainWake, 2);
+    EXPECT_EQ(queuedAfterOtherWakes, 2);
     EXPECT_EQ(trace, "O");
-}
 
-TEST_F(Scheduler, TwoWakeupsOfABlockedThreadQueueItOnce)
-{
     static int wakeups;
-    wakeups = 0;
     Greenthread *sleeper = greenthread_create(
         [](void *) {
             greenthread_block();
@@ -201,34 +167,20 @@ TEST_F(Scheduler, BlockingInTheMainContextOnlyTakesATurn)
     EXPECT_EQ(current_greenthread(), main_thread);
 }
 
-TEST_F(Scheduler, ThreadsCreateThreadsThatRunInQueueOrder)
-{
-    static std::vector<int> order;
-    order.clear();
-    greenthread_create(
-        [](void *) {
-            order.push_back(1);
-            greenthread_create([](void *) { order.push_back(3); }, nullptr);
-            greenthread_yield();
-            order.push_back(4);
-        },
-        nullptr);
-    greenthread_create([](void *) { order.push_back(2); }, nullptr);
-    greenthreads_run();
-    EXPECT_EQ(order, (std::vector<int>{1, 2, 3, 4}));
-}
-
-// ---------------------------------------------------------------------------
-// The run loop and the selector.
-
 int count_pass(int, unsigned, void *arg, SelFdEntry *)
 {
     ++*static_cast<int *>(arg);
     return 0;
 }
 
-TEST_F(Scheduler, RunWithoutThreadsReturnsWithoutWaitingInTheSelector)
+TEST_F(Scheduler, WithNothingQueuedYieldAndRunReturnAtOnce)
 {
+    greenthread_yield();
+    EXPECT_EQ(current_greenthread(), main_thread);
+    EXPECT_EQ(run_queue_head, nullptr);
+    EXPECT_EQ(run_queue_tail, nullptr);
+
+    // greenthreads_run does not even pass through the selector.
     int fds[2];
     ASSERT_EQ(pipe(fds), 0);
     ASSERT_EQ(write(fds[1], "x", 1), 1);
@@ -246,17 +198,13 @@ struct TimerWake {
     Greenthread *thread;
 };
 
-int wake_from_timer(SelTimer *timer)
-{
-    auto *wake = static_cast<TimerWake *>(timer->arg);
-    greenthread_wakeup(wake->thread);
-    return 0;
-}
-
 void block_until_timer(void *arg)
 {
     auto *wake = static_cast<TimerWake *>(arg);
-    wake->timer.callback = wake_from_timer;
+    wake->timer.callback = [](SelTimer *timer) {
+        greenthread_wakeup(static_cast<TimerWake *>(timer->arg)->thread);
+        return 0;
+    };
     wake->timer.arg = wake;
     SelMakeWhen(&wake->timer.when, 0, 20 * 1000 * 1000);
     SelAddTimer(&wake->timer);
@@ -264,30 +212,28 @@ void block_until_timer(void *arg)
     trace += 'T';
 }
 
-void run_until_every_thread_blocks_then_timer_wakes_one()
+/* Every thread blocks: the run loop waits in the selector until the timer
+ * wakes the last one, and returns once that one ends. */
+TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds)
 {
-    TimerWake wake{};
-    wake.thread = greenthread_create(block_until_timer, &wake);
-    Yielder other{'Y', 3};
-    greenthread_create(yield_in_loop, &other);
-    greenthreads_run();
-    EXPECT_EQ(trace, "YYYT");
-    EXPECT_EQ(live_threads, 0);
-    EXPECT_EQ(wake.timer.heapIndex, 0u);
-    EXPECT_EQ(wake.thread->runnable, 0);
-    EXPECT_EQ(free_threads, wake.thread) << "the timer's thread finished last";
-}
-
-TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorUntilTheLastThreadEnds)
-{
-    run_until_every_thread_blocks_then_timer_wakes_one();
-}
-
-TEST_F(Scheduler, InEpollModeTheRunLoopWaitsWithEpoll)
-{
-    ASSERT_EQ(SelUseEpoll(), 0);
-    ASSERT_NE(GetEpollFd(), 0);
-    run_until_every_thread_blocks_then_timer_wakes_one();
+    for (const bool epoll : {false, true}) {
+        SCOPED_TRACE(epoll ? "epoll mode" : "select mode");
+        if (epoll) {
+            ASSERT_EQ(SelUseEpoll(), 0);
+            ASSERT_NE(GetEpollFd(), 0);
+        }
+        trace.clear();
+        TimerWake wake{};
+        wake.thread = greenthread_create(block_until_timer, &wake);
+        Yielder other{'Y', 3};
+        greenthread_create(yield_in_loop, &other);
+        greenthreads_run();
+        EXPECT_EQ(trace, "YYYT");
+        EXPECT_EQ(live_threads, 0);
+        EXPECT_EQ(wake.timer.heapIndex, 0u);
+        EXPECT_EQ(wake.thread->runnable, 0);
+        EXPECT_EQ(free_threads, wake.thread) << "the timer's thread finished last";
+    }
     DeInitEpoll();
 }
 
