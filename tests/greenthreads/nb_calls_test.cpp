@@ -20,26 +20,20 @@ using NbCalls = GreenIo;
 
 int ignore_event(int, unsigned, void *, SelFdEntry *) { return 0; }
 
-/* Sleeps in the selector: a wait on no event ends with its time-out. */
-void sleep_ms(int ms) { nb_poll(-1, 0, ms); }
-
 TEST_F(NbCalls, ReadsWaitReturnShortCountsAndStopAtEndOfFile)
 {
-    int readall = -2, written = -2;
-    auto nothing = [&] {
-        readall = nb_readall(-1, nullptr, 0);
-        written = nb_write(-1, nullptr, 0);
-    };
-    run_threads(nothing);
-    EXPECT_EQ(readall, 0) << "a zero-length call made a system call on descriptor -1";
-    EXPECT_EQ(written, 0);
-
     SocketPair pair;
     char buf[100] = {};
-    int shortRead = 0, whole = 0, rest = 0;
-    auto shortReader = [&] { shortRead = nb_read(pair.fd[0], buf, sizeof buf); };
+    int readall = -2, written = -2, shortRead = 0, whole = 0, rest = 0;
+    auto shortReader = [&] {
+        readall = nb_readall(-1, nullptr, 0);
+        written = nb_write(-1, nullptr, 0);
+        shortRead = nb_read(pair.fd[0], buf, sizeof buf);
+    };
     auto digits = [&] { (void)write(pair.fd[1], "0123456789", 10); };
     run_threads(shortReader, digits);
+    EXPECT_EQ(readall, 0) << "a zero-length call made a system call on descriptor -1";
+    EXPECT_EQ(written, 0);
     EXPECT_EQ(shortRead, 10);
     EXPECT_EQ(std::string(buf, 10), "0123456789");
     expect_nothing_left(pair.fd[0]);
@@ -51,23 +45,21 @@ TEST_F(NbCalls, ReadsWaitReturnShortCountsAndStopAtEndOfFile)
     auto chunks = [&] {
         for (char c = 'a'; c <= 'd'; ++c) {
             (void)write(pair.fd[1], std::string(10, c).data(), 10);
-            sleep_ms(5); // lets the selector wake the reader between chunks
+            nb_poll(-1, 0, 5); // sleeps, so that the selector wakes the reader between chunks
         }
         pair.close_end(1);
     };
     run_threads(reader, chunks);
     EXPECT_EQ(whole, 30);
     EXPECT_EQ(rest, 10) << "the peer sent 10 of the 70 wanted bytes, then closed";
-    EXPECT_EQ(std::string(buf, 40), std::string(10, 'a') + std::string(10, 'b') + std::string(10, 'c') +
-                                        std::string(10, 'd'));
+    EXPECT_EQ(std::string(buf, 40), "aaaaaaaaaabbbbbbbbbbccccccccccdddddddddd");
     expect_nothing_left(pair.fd[0]);
 
     // A wait would fail on this registration: at end of file no wait is made.
     ASSERT_EQ(SelAddFD(pair.fd[0], SEL_READ, 0, ignore_event, nullptr), 0);
-    int atEnd = -2;
-    auto endReader = [&] { atEnd = nb_read(pair.fd[0], buf, sizeof buf); };
+    auto endReader = [&] { shortRead = nb_read(pair.fd[0], buf, sizeof buf); };
     run_threads(endReader);
-    EXPECT_EQ(atEnd, 0);
+    EXPECT_EQ(shortRead, 0);
     SelRemFD(pair.fd[0]);
 }
 
@@ -80,8 +72,7 @@ TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
     const size_t total = 1 << 20;
     std::vector<unsigned char> out(total), in(total);
     srand(7);
-    for (auto &byte : out)
-        byte = static_cast<unsigned char>(rand());
+    std::generate(out.begin(), out.end(), [] { return static_cast<unsigned char>(rand()); });
     int written = 0;
     size_t receivedWhenWriterReturned = 0, received = 0;
     auto writer = [&] {
@@ -134,10 +125,8 @@ TEST_F(NbCalls, AcceptAndConnectWaitForEachOtherAndARefusalIsReported)
     EXPECT_EQ(refused, failure(ECONNREFUSED));
     for (int fd : {listener.fd, client, refusedClient})
         expect_nothing_left(fd);
-    close(client);
-    close(refusedClient);
-    if (accepted >= 0)
-        close(accepted);
+    for (int fd : {client, refusedClient, accepted})
+        close(fd);
 }
 
 // EINTR ends a call at once. The descriptors are left blocking so that the
@@ -161,33 +150,23 @@ void rescue_after_first_signal(int)
     }
 }
 
-class Interrupted : public GreenIo {
-protected:
-    void SetUp() override
-    {
-        GreenIo::SetUp();
-        struct sigaction action = {};
-        action.sa_handler = rescue_after_first_signal;
-        action.sa_flags = 0; // no SA_RESTART: the system call fails with EINTR
-        sigaction(SIGALRM, &action, &previous);
-    }
-    void TearDown() override { sigaction(SIGALRM, &previous, nullptr); }
-    template <typename Call>
-    void expect_eintr_without_retry(Call call)
-    {
-        signalsSeen = 0;
-        Outcome outcome;
-        auto caller = [&] { outcome = with_errno(call()); };
-        itimerval every = {{0, 50000}, {0, 50000}}, off = {};
-        setitimer(ITIMER_REAL, &every, nullptr);
-        run_threads(caller);
-        setitimer(ITIMER_REAL, &off, nullptr);
-        EXPECT_EQ(outcome, failure(EINTR));
-    }
-    struct sigaction previous = {};
-};
+template <typename Call>
+void expect_eintr_without_retry(Call call)
+{
+    struct sigaction action = {};
+    action.sa_handler = rescue_after_first_signal; // no SA_RESTART: the system call fails with EINTR
+    sigaction(SIGALRM, &action, nullptr);
+    signalsSeen = 0;
+    Outcome outcome;
+    auto caller = [&] { outcome = with_errno(call()); };
+    itimerval every = {{0, 50000}, {0, 50000}}, off = {};
+    setitimer(ITIMER_REAL, &every, nullptr);
+    run_threads(caller);
+    setitimer(ITIMER_REAL, &off, nullptr);
+    EXPECT_EQ(outcome, failure(EINTR));
+}
 
-TEST_F(Interrupted, ReadAndAcceptReturnEintrWithoutRetrying)
+TEST_F(NbCalls, ReadAndAcceptReturnEintrWithoutRetrying)
 {
     int fds[2];
     ASSERT_EQ(pipe(fds), 0); // blocking

@@ -154,33 +154,29 @@ TEST_F(Scheduler, WakeupQueuesOnlyABlockedThreadAndOnlyOnce)
     EXPECT_EQ(wakeups, 2);
 }
 
-TEST_F(Scheduler, BlockingInTheMainContextOnlyTakesATurn)
-{
-    Yielder a{'A', 2};
-    greenthread_create(yield_in_loop, &a);
-    greenthread_block();
-    EXPECT_EQ(main_thread->runnable, 1);
-    EXPECT_EQ(trace, "A");
-    greenthread_block(); // nothing else runnable after the thread finishes
-    greenthread_block();
-    EXPECT_EQ(live_threads, 0);
-    EXPECT_EQ(current_greenthread(), main_thread);
-}
-
 int count_pass(int, unsigned, void *arg, SelFdEntry *)
 {
     ++*static_cast<int *>(arg);
     return 0;
 }
 
-TEST_F(Scheduler, WithNothingQueuedYieldAndRunReturnAtOnce)
+TEST_F(Scheduler, TheMainContextNeverBlocksAndRunWithoutThreadsSkipsTheSelector)
 {
-    greenthread_yield();
+    greenthread_yield(); // nothing queued: returns at once
     EXPECT_EQ(current_greenthread(), main_thread);
     EXPECT_EQ(run_queue_head, nullptr);
     EXPECT_EQ(run_queue_tail, nullptr);
 
-    // greenthreads_run does not even pass through the selector.
+    Yielder a{'A', 2};
+    greenthread_create(yield_in_loop, &a);
+    greenthread_block(); // only takes a turn
+    EXPECT_EQ(main_thread->runnable, 1);
+    EXPECT_EQ(trace, "A");
+    greenthread_block(); // nothing else runnable after the thread finishes
+    greenthread_block();
+    EXPECT_EQ(live_threads, 0);
+    EXPECT_EQ(current_greenthread(), main_thread);
+
     int fds[2];
     ASSERT_EQ(pipe(fds), 0);
     ASSERT_EQ(write(fds[1], "x", 1), 1);
