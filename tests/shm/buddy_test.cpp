@@ -4,7 +4,6 @@
 #include "shm_model.h"
 #include "shm_test_util.h"
 
-#include <cstring>
 #include <fcntl.h>
 #include <gtest/gtest.h>
 
@@ -19,24 +18,34 @@ class ExampleSegment : public ::testing::Test {
   protected:
     void SetUp() override {
         if (pageBytes() != 4096) GTEST_SKIP() << "the worked example assumes 4 KiB pages";
-        H = freeHeaderAddress(kExampleSize + 2 * pageBytes());
-        ASSERT_NE(H, 0u) << "no free address for the example";
-        if (H != 0x40000000u) std::printf("header at %#lx: 0x40000000 is in use here\n", (unsigned long)H);
-        h = ShmCreate(name.c_str(), reinterpret_cast<void *>(H + 0x1000), kExampleSize);
+        h = createAtFreeAddress(name.c_str(), kExampleSize, &H);
         ASSERT_NE(h, nullptr) << strerror(errno);
+        if (H != 0x40000000u) std::printf("header at %#lx: 0x40000000 is in use here\n", (unsigned long)H);
     }
     void TearDown() override {
         if (h != nullptr) ShmClose(h);
     }
-    std::string dump() {
+    void expectFresh() {
+        for (int k = 0; k < kClasses; k++) {
+            EXPECT_EQ(h->base->freeList[k], k == 9 ? H + 0x5000 : k == 11 ? H + 0x1000 : 0) << k;
+        }
+        EXPECT_EQ(ShmTotalFree(h), kExampleSize);
+    }
+    /* ShmPrintFree's lines. */
+    std::vector<std::string> dump() {
         char *text = nullptr;
         size_t length = 0;
         FILE *stream = open_memstream(&text, &length);
         ShmPrintFree(stream, h->base);
         fclose(stream);
-        std::string result(text, length);
+        std::vector<std::string> lines;
+        size_t start = 0;
+        for (size_t end; (end = std::string_view(text, length).find('\n', start)) != std::string::npos; start = end + 1) {
+            lines.emplace_back(text + start, end - start);
+        }
+        EXPECT_EQ(start, length) << "text after the last newline";
         free(text);
-        return result;
+        return lines;
     }
 
     NameGuard name{"example"};
@@ -50,19 +59,9 @@ std::string hex(uintptr_t address) {
     return text;
 }
 
-std::vector<std::string> lines(const std::string &text) {
-    std::vector<std::string> result;
-    size_t start = 0;
-    for (size_t end; (end = text.find('\n', start)) != std::string::npos; start = end + 1) {
-        result.push_back(text.substr(start, end - start));
-    }
-    EXPECT_EQ(start, text.size()) << "text after the last newline";
-    return result;
-}
-
 } // namespace
 
-TEST_F(ExampleSegment, SplitsTheHighestBlockOfTheNextClassAndMergesBack) {
+TEST_F(ExampleSegment, SplitsTheHighestBlockMergesBackAndRefusesWhenExhausted) {
     void *p = ShmAlloc(h, 100);
     const uintptr_t b = reinterpret_cast<uintptr_t>(p);
     EXPECT_EQ(b, H + 0x5000);
@@ -74,60 +73,40 @@ TEST_F(ExampleSegment, SplitsTheHighestBlockOfTheNextClassAndMergesBack) {
     EXPECT_EQ(h->base->freeList[9], 0u);
     EXPECT_EQ(h->base->freeList[11], H + 0x1000);
     EXPECT_EQ(classWordAt(b), slotAddress(h->base, 4));
-    if (sizeof(uintptr_t) == 4) {
-        EXPECT_EQ(classWordAt(b), H + 0x38) << "class word at " << hex(b - 4);
-    }
+    if (sizeof(uintptr_t) == 4) { EXPECT_EQ(classWordAt(b), H + 0x38) << "class word at " << hex(b - 4); }
     EXPECT_EQ(ShmTotalFree(h), 20352u);
-
     ShmFree(h, p);
-    for (int k = 0; k < kClasses; k++) {
-        EXPECT_EQ(h->base->freeList[k], k == 9 ? H + 0x5000 : k == 11 ? H + 0x1000 : 0) << k;
-    }
+    expectFresh();
     EXPECT_EQ(classWordAt(b), slotAddress(h->base, 9));
-    if (sizeof(uintptr_t) == 4) {
-        EXPECT_EQ(classWordAt(b), H + 0x4C);
-    }
-    EXPECT_EQ(ShmTotalFree(h), kExampleSize);
-}
+    if (sizeof(uintptr_t) == 4) { EXPECT_EQ(classWordAt(b), H + 0x4C); }
 
-TEST_F(ExampleSegment, BlockWhosePartnerLiesOutsideNeverMerges) {
-    void *p = ShmAlloc(h, 10000);
-    ASSERT_EQ(reinterpret_cast<uintptr_t>(p), H + 0x1000);
+    // The class-11 block's partner lies outside the segment: it never merges.
+    void *big = ShmAlloc(h, 10000);
+    ASSERT_EQ(reinterpret_cast<uintptr_t>(big), H + 0x1000);
     EXPECT_EQ(h->base->freeList[11], 0u);
-    ShmFree(h, p);
-    EXPECT_EQ(h->base->freeList[11], H + 0x1000);
-    EXPECT_EQ(h->base->freeList[12], 0u);
-    EXPECT_EQ(ShmTotalFree(h), kExampleSize);
-}
-
-TEST_F(ExampleSegment, ExhaustionFailsWithEnomemAndChangesNothing) {
-    ASSERT_NE(ShmAlloc(h, 10000), nullptr);
-    ASSERT_NE(ShmAlloc(h, 4000), nullptr);
-    uintptr_t lists[kClasses];
-    memcpy(lists, h->base->freeList, sizeof lists);
-    errno = 0;
-    EXPECT_EQ(ShmAlloc(h, 1), nullptr);
-    EXPECT_EQ(errno, ENOMEM);
-    EXPECT_EQ(memcmp(lists, h->base->freeList, sizeof lists), 0);
+    ASSERT_EQ(reinterpret_cast<uintptr_t>(ShmAlloc(h, 4000)), H + 0x5000);
+    const ListHeads lists(h->base);
+    EXPECT_REFUSED(ENOMEM, ShmAlloc(h, 1));
+    EXPECT_TRUE(lists.unchanged());
     EXPECT_EQ(h->base->busy, 0u);
     EXPECT_EQ(ShmTotalFree(h), 0u);
+    ShmFree(h, big);
+    ShmFree(h, reinterpret_cast<void *>(H + 0x5000));
+    expectFresh();
 }
 
 TEST_F(ExampleSegment, DumpPrintsOneLinePerClass) {
-    std::vector<std::string> fresh = lines(dump());
+    std::vector<std::string> fresh = dump();
     ASSERT_EQ(fresh.size(), 27u);
     EXPECT_EQ(fresh[0], "0x00000008 [0] = { }");
     EXPECT_EQ(fresh[9], "0x00001000 [9] = { " + hex(H + 0x5000) + " }");
     EXPECT_EQ(fresh[11], "0x00004000 [11] = { " + hex(H + 0x1000) + " }");
     EXPECT_EQ(fresh[26], "0x20000000 [26] = { }");
-    if (H == 0x40000000u) {
-        EXPECT_EQ(fresh[9], "0x00001000 [9] = { 0x40005000 }");
-    }
+    if (H == 0x40000000u) { EXPECT_EQ(fresh[9], "0x00001000 [9] = { 0x40005000 }"); }
     for (int k = 0; k < kClasses; k++) {
-        if (k == 9 || k == 11) continue;
         char expected[64];
         snprintf(expected, sizeof expected, "0x%08x [%d] = { }", unsigned(classBytes(k)), k);
-        EXPECT_EQ(fresh[k], expected);
+        if (k != 9 && k != 11) { EXPECT_EQ(fresh[k], expected); }
     }
 
     // Two entries in one list: highest first, separated by a comma.
@@ -135,7 +114,7 @@ TEST_F(ExampleSegment, DumpPrintsOneLinePerClass) {
     ASSERT_EQ(reinterpret_cast<uintptr_t>(top), H + 0x5000);
     ASSERT_EQ(reinterpret_cast<uintptr_t>(ShmAlloc(h, 4000)), H + 0x1000);
     ShmFree(h, top);
-    std::vector<std::string> later = lines(dump());
+    std::vector<std::string> later = dump();
     ASSERT_EQ(later.size(), 27u);
     EXPECT_EQ(later[9], "0x00001000 [9] = { " + hex(H + 0x5000) + ", " + hex(H + 0x2000) + " }");
     EXPECT_EQ(later[10], "0x00002000 [10] = { " + hex(H + 0x3000) + " }");
@@ -149,24 +128,17 @@ TEST(ShmAlloc, SmallestClassHoldingTheRequestAndItsClassWord) {
         void *p = ShmAlloc(h, n);
         EXPECT_NE(p, nullptr) << n;
         if (p == nullptr) return -1;
-        const uintptr_t word = classWordAt(reinterpret_cast<uintptr_t>(p));
-        const int k = int((word - slotAddress(h->base, 0)) / sizeof(uintptr_t));
+        const int k = int((classWordAt(reinterpret_cast<uintptr_t>(p)) - slotAddress(h->base, 0)) / sizeof(uintptr_t));
         ShmFree(h, p);
         return k;
     };
     const int smallest = sizeof(uintptr_t) == 4 ? 0 : 1;
     EXPECT_EQ(classOf(0), smallest);
     EXPECT_EQ(classOf(sizeof(uintptr_t)), smallest);
-    for (int k = smallest; k < 9; k++) {
+    for (int k = smallest; k < 10; k++) { // on 32 bits: 4 -> 0, 5 -> 1, ... 4092 -> 9, 4093 -> 10
         const uint32_t fits = uint32_t(classBytes(k) - sizeof(uintptr_t));
         EXPECT_EQ(classOf(fits), k) << fits;
         EXPECT_EQ(classOf(fits + 1), k + 1) << fits + 1;
-    }
-    if (sizeof(uintptr_t) == 4) {
-        EXPECT_EQ(classOf(4), 0);
-        EXPECT_EQ(classOf(5), 1);
-        EXPECT_EQ(classOf(4092), 9);
-        EXPECT_EQ(classOf(4093), 10);
     }
     EXPECT_EQ(ShmTotalFree(h), 1u << 16);
     ShmClose(h);
@@ -178,24 +150,15 @@ TEST(ShmAlloc, OversizedRequestsFailBeforeTheLock) {
     ASSERT_NE(h, nullptr);
     auto *lastMetadataWord = reinterpret_cast<uintptr_t *>(ShmAddr(h)) - 1;
     *lastMetadataWord = 0x5a5a5a5a;
-    uintptr_t lists[kClasses];
-    memcpy(lists, h->base->freeList, sizeof lists);
+    const ListHeads lists(h->base);
     // With busy set, only a request refused before the lock reports ENOMEM.
     h->base->busy = 1;
     const uint32_t tooBig = uint32_t(0x20000000u - sizeof(uintptr_t) + 1);
-    for (uint32_t n : {0x40000000u, 0xFFFFFFFFu, tooBig}) {
-        errno = 0;
-        EXPECT_EQ(ShmAlloc(h, n), nullptr) << n;
-        EXPECT_EQ(errno, ENOMEM) << n;
-    }
-    errno = 0;
-    EXPECT_EQ(ShmAlloc(h, tooBig - 1), nullptr) << "the largest class goes through the lock";
-    EXPECT_EQ(errno, EBUSY);
+    for (uint32_t n : {0x40000000u, 0xFFFFFFFFu, tooBig}) EXPECT_REFUSED(ENOMEM, ShmAlloc(h, n));
+    EXPECT_REFUSED(EBUSY, ShmAlloc(h, tooBig - 1)); // the largest class goes through the lock
     h->base->busy = 0;
-    errno = 0;
-    EXPECT_EQ(ShmAlloc(h, tooBig - 1), nullptr);
-    EXPECT_EQ(errno, ENOMEM);
-    EXPECT_EQ(memcmp(lists, h->base->freeList, sizeof lists), 0);
+    EXPECT_REFUSED(ENOMEM, ShmAlloc(h, tooBig - 1));
+    EXPECT_TRUE(lists.unchanged());
     EXPECT_EQ(*lastMetadataWord, uintptr_t{0x5a5a5a5a});
     ShmClose(h);
 }
@@ -206,45 +169,41 @@ TEST(ShmFree, NullAndForeignPointersChangeNothing) {
     ShmHandle *other = ShmCreate(otherName.c_str(), nullptr, 64 * pageBytes());
     ASSERT_NE(mine, nullptr);
     ASSERT_NE(other, nullptr);
-    const uintptr_t base = reinterpret_cast<uintptr_t>(mine->base);
     auto *big = static_cast<unsigned char *>(ShmAlloc(mine, 4000));
     ASSERT_NE(big, nullptr);
     memset(big, 0xa5, 4000);
     void *foreign = ShmAlloc(other, 100);
     ASSERT_NE(foreign, nullptr);
 
-    // Class words that sit in the right header page but name no list slot,
-    // and one whose block would run past the end of the segment.
+    // Class words in the right header page that name no list slot, and one
+    // whose block would run past the end of the segment.
     auto forge = [&](size_t offset, uintptr_t word) {
         *reinterpret_cast<uintptr_t *>(big + offset - sizeof(uintptr_t)) = word;
         return static_cast<void *>(big + offset);
     };
-    void *namesSize = forge(256, base + offsetof(ShmHeader, size));
-    void *pastSlots = forge(512, slotAddress(mine->base, 26) + sizeof(uintptr_t));
-    void *misaligned = forge(768, slotAddress(mine->base, 3) + 1);
-    void *tooLong = forge(1024, slotAddress(mine->base, 20));
     int onStack = 0;
-    uintptr_t lists[kClasses];
-    memcpy(lists, mine->base->freeList, sizeof lists);
-    const uint32_t freeBytes = ShmTotalFree(mine);
-
-    struct Case {
+    const struct {
         const char *what;
         void *p;
     } cases[] = {
-        {"block of another segment", foreign}, {"inside a block", big + 64},
-        {"word naming size", namesSize},       {"past the last slot", pastSlots},
-        {"between slots", misaligned},          {"block past the end", tooLong},
-        {"stack address", &onStack},            {"header page", mine->base},
+        {"block of another segment", foreign},
+        {"inside a block", big + 64},
+        {"word naming size", forge(256, reinterpret_cast<uintptr_t>(mine->base) + offsetof(ShmHeader, size))},
+        {"past the last slot", forge(512, slotAddress(mine->base, 26) + sizeof(uintptr_t))},
+        {"between slots", forge(768, slotAddress(mine->base, 3) + 1)},
+        {"block past the end", forge(1024, slotAddress(mine->base, 20))},
+        {"stack address", &onStack},
+        {"header page", mine->base},
     };
-    for (const Case &c : cases) {
+    const ListHeads lists(mine->base);
+    const uint32_t freeBytes = ShmTotalFree(mine);
+    for (const auto &c : cases) {
         testing::internal::CaptureStderr();
         errno = 4321;
         ShmFree(mine, c.p);
-        EXPECT_EQ(testing::internal::GetCapturedStderr(), "ShmFree(): mismatched handle and pointer\n")
-            << c.what;
         EXPECT_EQ(errno, 4321) << c.what;
-        EXPECT_EQ(memcmp(lists, mine->base->freeList, sizeof lists), 0) << c.what;
+        EXPECT_EQ(testing::internal::GetCapturedStderr(), "ShmFree(): mismatched handle and pointer\n") << c.what;
+        EXPECT_TRUE(lists.unchanged()) << c.what;
         EXPECT_EQ(mine->base->busy, 0u) << c.what;
     }
     testing::internal::CaptureStderr();
@@ -275,8 +234,7 @@ TEST_F(ShmFreeDeathTest, DoubleFreeEndsWithStatus100AndLeavesTheSegmentUsable) {
     EXPECT_EQ(h->base->busy, 0u);
     EXPECT_EQ(pthread_mutex_trylock(&h->base->mutex), 0) << "the mutex was left locked";
     pthread_mutex_unlock(&h->base->mutex);
-    EXPECT_EQ(ShmTotalFree(h), kExampleSize);
-    EXPECT_EQ(h->base->freeList[9], H + 0x5000);
+    expectFresh();
     EXPECT_NE(ShmAlloc(second, 100), nullptr);
     ShmClose(second);
 }

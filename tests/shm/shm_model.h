@@ -17,51 +17,38 @@
 namespace qorbu::test {
 
 constexpr int kClasses = 27;
-constexpr uintptr_t kWord = sizeof(uintptr_t);
 
 inline uintptr_t classBytes(int k) { return uintptr_t{8} << k; }
 
-/* The smallest class that holds n bytes and the class word below, and whose
- * free blocks hold their link apart from the next block's class word; -1
- * when none does. */
+/* The smallest class holding n bytes and the class word below, and whose
+ * free blocks keep their link apart from the next block's class word. */
 inline int modelClassFor(uint32_t n) {
-    if (n >= 0x40000000u) return -1;
-    for (int k = 0; k < kClasses; k++) {
-        if (uint64_t{n} + kWord <= classBytes(k) && 2 * kWord <= classBytes(k)) return k;
+    for (int k = 0; n < 0x40000000u && k < kClasses; k++) {
+        if (uint64_t{n} + sizeof(uintptr_t) <= classBytes(k) && 2 * sizeof(uintptr_t) <= classBytes(k)) return k;
     }
     return -1;
 }
 
 inline uintptr_t partnerOf(uintptr_t block, int k) {
-    const uintptr_t size = classBytes(k);
-    return block % (2 * size) == 0 ? block + size : block - size;
+    return block % (2 * classBytes(k)) == 0 ? block + classBytes(k) : block - classBytes(k);
 }
 
 /* Free lists as sets (highest address first) and allocated blocks by address. */
 class BuddyModel {
   public:
-    BuddyModel(uintptr_t header, uint32_t length)
-        : dataStart_(header + static_cast<uintptr_t>(getpagesize())), end_(header + length) {
-        uintptr_t position = dataStart_;
-        uintptr_t remaining = end_ - dataStart_;
-        int k = 0;
-        while (k < kClasses - 1 && classBytes(k) < remaining) k++;
-        for (; k >= 0; k--) {
-            while (remaining >= classBytes(k)) {
-                lists_[k].insert(position);
-                position += classBytes(k);
-                remaining -= classBytes(k);
-            }
+    BuddyModel(uintptr_t header, uint32_t length) {
+        uintptr_t position = header + static_cast<uintptr_t>(getpagesize());
+        for (int k = kClasses - 1; k >= 0; k--) {
+            for (; header + length - position >= classBytes(k); position += classBytes(k)) lists_[k].insert(position);
         }
     }
 
     /* What ShmAlloc must return for n (0 for ENOMEM). */
     uintptr_t alloc(uint32_t n) {
         const int k = modelClassFor(n);
-        if (k < 0) return 0;
         int j = k;
-        while (j < kClasses && lists_[j].empty()) j++;
-        if (j == kClasses) return 0;
+        while (k >= 0 && j < kClasses && lists_[j].empty()) j++;
+        if (k < 0 || j == kClasses) return 0;
         const uintptr_t block = *lists_[j].begin();
         lists_[j].erase(lists_[j].begin());
         for (int i = j - 1; i >= k; i--) lists_[i].insert(block + classBytes(i));
@@ -72,13 +59,8 @@ class BuddyModel {
     void free(uintptr_t block) {
         int k = allocated_.at(block);
         allocated_.erase(block);
-        for (;;) {
-            if (k == kClasses - 1) break;
-            const uintptr_t partner = partnerOf(block, k);
-            if (lists_[k].count(partner) == 0) break;
-            lists_[k].erase(partner);
-            block = std::min(block, partner);
-            k++;
+        for (; k < kClasses - 1 && lists_[k].erase(partnerOf(block, k)) == 1; k++) {
+            block = std::min(block, partnerOf(block, k));
         }
         lists_[k].insert(block);
     }
@@ -88,8 +70,6 @@ class BuddyModel {
     int classOf(uintptr_t block) const { return allocated_.at(block); }
 
   private:
-    uintptr_t dataStart_;
-    uintptr_t end_;
     std::set<uintptr_t, std::greater<>> lists_[kClasses];
     std::map<uintptr_t, int> allocated_;
 };
@@ -97,22 +77,20 @@ class BuddyModel {
 /* Walks list k of a header, at most `limit` entries (a cycle stops there). */
 inline std::vector<uintptr_t> walkList(const ShmHeader *h, int k, size_t limit = 1u << 20) {
     std::vector<uintptr_t> entries;
-    for (uintptr_t e = h->freeList[k]; e != 0 && entries.size() < limit;
-         e = *reinterpret_cast<const uintptr_t *>(e)) {
+    for (uintptr_t e = h->freeList[k]; e != 0 && entries.size() < limit; e = *reinterpret_cast<const uintptr_t *>(e)) {
         entries.push_back(e);
     }
     return entries;
 }
 
-/* Checks the lists of a segment without trusting the allocator's code:
- * every list strictly descending and inside the data area, no two free
- * partners left unmerged, and free plus allocated blocks tiling the data
- * area exactly. Returns an empty string, or what is wrong. */
+/* Checks the lists without trusting the allocator's code: every list
+ * strictly descending and inside the data area, no two free partners left
+ * unmerged, and free plus allocated blocks tiling the data area exactly.
+ * Returns an empty string, or what is wrong. */
 inline std::string checkLists(const ShmHeader *h, const std::map<uintptr_t, int> &allocated) {
-    const uintptr_t page = static_cast<uintptr_t>(getpagesize());
-    const uintptr_t dataStart = h->base + page;
+    const uintptr_t dataStart = h->base + static_cast<uintptr_t>(getpagesize());
     const uintptr_t end = h->base + h->size;
-    std::vector<std::pair<uintptr_t, uintptr_t>> pieces;  // start, length
+    std::vector<std::pair<uintptr_t, uintptr_t>> pieces; // start, length
     std::set<std::pair<int, uintptr_t>> free;
     for (int k = 0; k < kClasses; k++) {
         const std::vector<uintptr_t> entries = walkList(h, k, (end - dataStart) / 8 + 1);
@@ -126,14 +104,11 @@ inline std::string checkLists(const ShmHeader *h, const std::map<uintptr_t, int>
             free.emplace(k, e);
         }
     }
-    // Partners lie by absolute address: above a block aligned to twice its
-    // size, below it otherwise. Blocks not aligned to their own size (the
-    // data area starts on a page) can name a partner that does not name
-    // them back; two free blocks that name each other must have merged.
+    // A block not aligned to its own size (the data area starts on a page)
+    // can name a partner that does not name it back; two free blocks that
+    // name each other must have merged.
     for (const auto &[k, e] : free) {
-        if (k == kClasses - 1) continue;
-        const uintptr_t partner = partnerOf(e, k);
-        if (free.count({k, partner}) != 0 && partnerOf(partner, k) == e) {
+        if (k < kClasses - 1 && free.count({k, partnerOf(e, k)}) != 0 && partnerOf(partnerOf(e, k), k) == e) {
             return "unmerged partners in list " + std::to_string(k);
         }
     }
@@ -144,18 +119,14 @@ inline std::string checkLists(const ShmHeader *h, const std::map<uintptr_t, int>
         if (start != expected) return "blocks overlap or leave a gap";
         expected = start + length;
     }
-    if (expected != end) return "blocks do not reach the end of the data area";
-    return "";
+    return expected == end ? "" : "blocks do not reach the end of the data area";
 }
 
 /* Whether the segment's lists are exactly those of the model. */
 inline bool listsMatch(const ShmHeader *h, const BuddyModel &model) {
     for (int k = 0; k < kClasses; k++) {
         const auto &expected = model.list(k);
-        if (walkList(h, k, expected.size() + 1) !=
-            std::vector<uintptr_t>(expected.begin(), expected.end())) {
-            return false;
-        }
+        if (walkList(h, k, expected.size() + 1) != std::vector<uintptr_t>(expected.begin(), expected.end())) return false;
     }
     return true;
 }
