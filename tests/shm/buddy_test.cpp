@@ -1,17 +1,23 @@
-/* Buddy allocation: size classes, the worked split and merge example,
- * refused requests, foreign pointers, double frees and the list dump. */
+/* Buddy allocation: the worked example (layout, split, merge, list dump),
+ * size classes, refused requests, foreign pointers, double frees, and random
+ * operation sequences against the reference model: after every operation
+ * the lists equal the model's, stay strictly descending, keep no free
+ * partners apart and tile the data area with the allocated blocks. */
 #include "shm/shm.h"
 #include "shm_model.h"
 #include "shm_test_util.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <map>
+#include <random>
 
 using namespace qorbu::test;
 
 namespace {
 
 constexpr uint32_t kExampleSize = 20480;
+using Lists = std::map<int, std::vector<uintptr_t>>; // class -> entries, highest first
 
 /* The 20480-byte example segment at a fixed header address free here. */
 class ExampleSegment : public ::testing::Test {
@@ -25,27 +31,23 @@ class ExampleSegment : public ::testing::Test {
     void TearDown() override {
         if (h != nullptr) ShmClose(h);
     }
+    Lists fresh() const { return {{9, {H + 0x5000}}, {11, {H + 0x1000}}}; }
+    void expectLists(Lists lists) {
+        for (int k = 0; k < kClasses; k++) EXPECT_EQ(walkList(h->base, k, 8), lists[k]) << "class " << k;
+    }
     void expectFresh() {
-        for (int k = 0; k < kClasses; k++) {
-            EXPECT_EQ(h->base->freeList[k], k == 9 ? H + 0x5000 : k == 11 ? H + 0x1000 : 0) << k;
-        }
+        expectLists(fresh());
         EXPECT_EQ(ShmTotalFree(h), kExampleSize);
     }
-    /* ShmPrintFree's lines. */
-    std::vector<std::string> dump() {
+    std::string dump() {
         char *text = nullptr;
         size_t length = 0;
         FILE *stream = open_memstream(&text, &length);
         ShmPrintFree(stream, h->base);
         fclose(stream);
-        std::vector<std::string> lines;
-        size_t start = 0;
-        for (size_t end; (end = std::string_view(text, length).find('\n', start)) != std::string::npos; start = end + 1) {
-            lines.emplace_back(text + start, end - start);
-        }
-        EXPECT_EQ(start, length) << "text after the last newline";
+        std::string result(text, length);
         free(text);
-        return lines;
+        return result;
     }
 
     NameGuard name{"example"};
@@ -59,19 +61,104 @@ std::string hex(uintptr_t address) {
     return text;
 }
 
+/* ShmPrintFree's text for these lists (every other list empty). */
+std::string expectedDump(Lists lists) {
+    std::string text;
+    for (int k = 0; k < kClasses; k++) {
+        char line[32];
+        snprintf(line, sizeof line, "0x%08x [%d] = {", unsigned(classBytes(k)), k);
+        text += line;
+        for (size_t i = 0; i < lists[k].size(); i++) text += (i == 0 ? " " : ", ") + hex(lists[k][i]);
+        text += " }\n";
+    }
+    return text;
+}
+
+/* On an aligned segment freeing everything must restore the fresh lists. */
+void runSequence(uint32_t dataBytes, unsigned seed, int operations, bool aligned) {
+    NameGuard name("model");
+    ShmHandle *h = aligned ? createAligned(name.c_str(), dataBytes) : ShmCreate(name.c_str(), nullptr, dataBytes);
+    ASSERT_NE(h, nullptr);
+    BuddyModel model(reinterpret_cast<uintptr_t>(h->base), h->size);
+    ASSERT_TRUE(listsMatch(h->base, model)) << "fresh segment";
+    std::mt19937 rng(seed);
+    std::vector<std::pair<uintptr_t, uint32_t>> live; // block, bytes written
+    for (int op = 0; op < operations; op++) {
+        SCOPED_TRACE("op " + std::to_string(op));
+        if (live.empty() || std::uniform_int_distribution<int>(0, 99)(rng) < 55) {
+            // Log-uniform sizes: as many tiny as large requests.
+            const int bits = std::uniform_int_distribution<int>(0, 31 - __builtin_clz(dataBytes))(rng);
+            const uint32_t n = std::uniform_int_distribution<uint32_t>(0, (2u << bits) - 1)(rng) % (dataBytes + 1);
+            const uintptr_t expected = model.alloc(n);
+            errno = 0;
+            const uintptr_t got = reinterpret_cast<uintptr_t>(ShmAlloc(h, n));
+            ASSERT_EQ(got, expected) << "alloc " << n;
+            if (got == 0) {
+                ASSERT_EQ(errno, ENOMEM);
+                continue;
+            }
+            ASSERT_EQ(classWordAt(got), slotAddress(h->base, model.classOf(got)));
+            fillPattern(reinterpret_cast<void *>(got), n, uint32_t(got >> 3));
+            live.emplace_back(got, n);
+        } else {
+            const size_t i = std::uniform_int_distribution<size_t>(0, live.size() - 1)(rng);
+            const auto [block, n] = live[i];
+            ASSERT_TRUE(patternIntact(reinterpret_cast<void *>(block), n, uint32_t(block >> 3)));
+            live[i] = live.back();
+            live.pop_back();
+            model.free(block);
+            ShmFree(h, reinterpret_cast<void *>(block));
+        }
+        ASSERT_TRUE(listsMatch(h->base, model));
+        ASSERT_EQ(checkLists(h->base, model.allocated()), "");
+    }
+    for (const auto &[block, n] : live) {
+        model.free(block);
+        ShmFree(h, reinterpret_cast<void *>(block));
+    }
+    EXPECT_TRUE(listsMatch(h->base, model));
+    EXPECT_EQ(checkLists(h->base, {}), "");
+    if (aligned) {
+        EXPECT_TRUE(listsMatch(h->base, BuddyModel(reinterpret_cast<uintptr_t>(h->base), h->size)))
+            << "all freed: the lists of a fresh segment";
+    }
+    EXPECT_EQ(ShmTotalFree(h), h->size - pageBytes());
+    ShmClose(h);
+}
+
 } // namespace
+
+TEST_F(ExampleSegment, LayoutAndDump) {
+    EXPECT_EQ(reinterpret_cast<uintptr_t>(h->base), H);
+    EXPECT_EQ(reinterpret_cast<uintptr_t>(ShmAddr(h)), H + 0x1000);
+    EXPECT_EQ(ShmOverhead(), 4096);
+    EXPECT_EQ(h->size, 24576u);
+    EXPECT_EQ(h->base->base, H);
+    EXPECT_EQ(h->base->size, 24576u);
+    EXPECT_EQ(h->base->useFlock, 0u);
+    EXPECT_EQ(h->base->busy, 0u);
+    expectFresh();
+    const std::string dumped = dump();
+    EXPECT_EQ(dumped, expectedDump(fresh()));
+    EXPECT_EQ(dumped.substr(0, 21), "0x00000008 [0] = { }\n");
+    EXPECT_NE(dumped.find("\n0x20000000 [26] = { }\n"), std::string::npos);
+    if (H == 0x40000000u) { EXPECT_NE(dumped.find("\n0x00001000 [9] = { 0x40005000 }\n"), std::string::npos); }
+
+    const uint32_t metadataRoom = uint32_t(4096 - sizeof(ShmHeader));
+    if (sizeof(uintptr_t) == 4) { EXPECT_EQ(metadataRoom, 3948u); }
+    EXPECT_EQ(reinterpret_cast<uintptr_t>(ShmMetadata(h, metadataRoom)), H + sizeof(ShmHeader));
+    EXPECT_REFUSED(ENOMEM, ShmMetadata(h, metadataRoom + 1));
+    ShmClose(h);
+    h = nullptr;
+    EXPECT_TRUE(rangeIsFree(H, 24576));
+}
 
 TEST_F(ExampleSegment, SplitsTheHighestBlockMergesBackAndRefusesWhenExhausted) {
     void *p = ShmAlloc(h, 100);
     const uintptr_t b = reinterpret_cast<uintptr_t>(p);
     EXPECT_EQ(b, H + 0x5000);
-    const uintptr_t expected[] = {H + 0x5080, H + 0x5100, H + 0x5200, H + 0x5400, H + 0x5800};
-    for (int k = 4; k <= 8; k++) {
-        EXPECT_EQ(h->base->freeList[k], expected[k - 4]) << "class " << k;
-        EXPECT_EQ(*reinterpret_cast<uintptr_t *>(expected[k - 4]), 0u) << "class " << k;
-    }
-    EXPECT_EQ(h->base->freeList[9], 0u);
-    EXPECT_EQ(h->base->freeList[11], H + 0x1000);
+    expectLists({{4, {H + 0x5080}}, {5, {H + 0x5100}}, {6, {H + 0x5200}}, {7, {H + 0x5400}}, {8, {H + 0x5800}},
+                 {11, {H + 0x1000}}});
     EXPECT_EQ(classWordAt(b), slotAddress(h->base, 4));
     if (sizeof(uintptr_t) == 4) { EXPECT_EQ(classWordAt(b), H + 0x38) << "class word at " << hex(b - 4); }
     EXPECT_EQ(ShmTotalFree(h), 20352u);
@@ -80,10 +167,8 @@ TEST_F(ExampleSegment, SplitsTheHighestBlockMergesBackAndRefusesWhenExhausted) {
     EXPECT_EQ(classWordAt(b), slotAddress(h->base, 9));
     if (sizeof(uintptr_t) == 4) { EXPECT_EQ(classWordAt(b), H + 0x4C); }
 
-    // The class-11 block's partner lies outside the segment: it never merges.
     void *big = ShmAlloc(h, 10000);
     ASSERT_EQ(reinterpret_cast<uintptr_t>(big), H + 0x1000);
-    EXPECT_EQ(h->base->freeList[11], 0u);
     ASSERT_EQ(reinterpret_cast<uintptr_t>(ShmAlloc(h, 4000)), H + 0x5000);
     const ListHeads lists(h->base);
     EXPECT_REFUSED(ENOMEM, ShmAlloc(h, 1));
@@ -92,35 +177,19 @@ TEST_F(ExampleSegment, SplitsTheHighestBlockMergesBackAndRefusesWhenExhausted) {
     EXPECT_EQ(ShmTotalFree(h), 0u);
     ShmFree(h, big);
     ShmFree(h, reinterpret_cast<void *>(H + 0x5000));
-    expectFresh();
-}
+    expectFresh(); // the class-11 block's partner lies outside the segment
 
-TEST_F(ExampleSegment, DumpPrintsOneLinePerClass) {
-    std::vector<std::string> fresh = dump();
-    ASSERT_EQ(fresh.size(), 27u);
-    EXPECT_EQ(fresh[0], "0x00000008 [0] = { }");
-    EXPECT_EQ(fresh[9], "0x00001000 [9] = { " + hex(H + 0x5000) + " }");
-    EXPECT_EQ(fresh[11], "0x00004000 [11] = { " + hex(H + 0x1000) + " }");
-    EXPECT_EQ(fresh[26], "0x20000000 [26] = { }");
-    if (H == 0x40000000u) { EXPECT_EQ(fresh[9], "0x00001000 [9] = { 0x40005000 }"); }
-    for (int k = 0; k < kClasses; k++) {
-        char expected[64];
-        snprintf(expected, sizeof expected, "0x%08x [%d] = { }", unsigned(classBytes(k)), k);
-        if (k != 9 && k != 11) { EXPECT_EQ(fresh[k], expected); }
-    }
-
-    // Two entries in one list: highest first, separated by a comma.
+    // Two entries in one list, highest first (also in the dump).
     void *top = ShmAlloc(h, 4000);
     ASSERT_EQ(reinterpret_cast<uintptr_t>(top), H + 0x5000);
     ASSERT_EQ(reinterpret_cast<uintptr_t>(ShmAlloc(h, 4000)), H + 0x1000);
     ShmFree(h, top);
-    std::vector<std::string> later = dump();
-    ASSERT_EQ(later.size(), 27u);
-    EXPECT_EQ(later[9], "0x00001000 [9] = { " + hex(H + 0x5000) + ", " + hex(H + 0x2000) + " }");
-    EXPECT_EQ(later[10], "0x00002000 [10] = { " + hex(H + 0x3000) + " }");
+    const Lists two = {{9, {H + 0x5000, H + 0x2000}}, {10, {H + 0x3000}}};
+    expectLists(two);
+    EXPECT_EQ(dump(), expectedDump(two));
 }
 
-TEST(ShmAlloc, SmallestClassHoldingTheRequestAndItsClassWord) {
+TEST(ShmAlloc, SmallestClassHoldingRequestAndClassWordAndOversizedRefusedEarly) {
     NameGuard name("classes");
     ShmHandle *h = ShmCreate(name.c_str(), nullptr, 1u << 16);
     ASSERT_NE(h, nullptr);
@@ -141,17 +210,11 @@ TEST(ShmAlloc, SmallestClassHoldingTheRequestAndItsClassWord) {
         EXPECT_EQ(classOf(fits + 1), k + 1) << fits + 1;
     }
     EXPECT_EQ(ShmTotalFree(h), 1u << 16);
-    ShmClose(h);
-}
 
-TEST(ShmAlloc, OversizedRequestsFailBeforeTheLock) {
-    NameGuard name("huge");
-    ShmHandle *h = ShmCreate(name.c_str(), nullptr, 4 * pageBytes());
-    ASSERT_NE(h, nullptr);
+    // Oversized requests fail before the lock: with busy set, only they report ENOMEM.
     auto *lastMetadataWord = reinterpret_cast<uintptr_t *>(ShmAddr(h)) - 1;
     *lastMetadataWord = 0x5a5a5a5a;
     const ListHeads lists(h->base);
-    // With busy set, only a request refused before the lock reports ENOMEM.
     h->base->busy = 1;
     const uint32_t tooBig = uint32_t(0x20000000u - sizeof(uintptr_t) + 1);
     for (uint32_t n : {0x40000000u, 0xFFFFFFFFu, tooBig}) EXPECT_REFUSED(ENOMEM, ShmAlloc(h, n));
@@ -237,4 +300,20 @@ TEST_F(ShmFreeDeathTest, DoubleFreeEndsWithStatus100AndLeavesTheSegmentUsable) {
     expectFresh();
     EXPECT_NE(ShmAlloc(second, 100), nullptr);
     ShmClose(second);
+}
+
+TEST(ShmModel, RandomSequencesOnSegmentsOfManyShapes) {
+    const uint32_t page = uint32_t(pageBytes());
+    const struct {
+        uint32_t bytes;
+        bool aligned;
+    } shapes[] = {{page, false},       {5 * page, false},       {20480, false},       {37 * page, false},
+                  {(1u << 20) + 3 * page, false}, {(4u << 20) - page, false}, {page, true},
+                  {1u << 16, true},    {1u << 20, true},        {4u << 20, true}};
+    unsigned seed = 1;
+    for (const auto &s : shapes) {
+        SCOPED_TRACE("data bytes " + std::to_string(s.bytes) + (s.aligned ? ", aligned" : ""));
+        runSequence(s.bytes, seed++, scaled(4000, 800), s.aligned);
+        if (HasFatalFailure()) return;
+    }
 }
