@@ -126,7 +126,8 @@ inline std::string checkLists(const ShmHeader *h, const std::map<uintptr_t, int>
 inline bool listsMatch(const ShmHeader *h, const BuddyModel &model) {
     for (int k = 0; k < kClasses; k++) {
         const auto &expected = model.list(k);
-        if (walkList(h, k, expected.size() + 1) != std::vector<uintptr_t>(expected.begin(), expected.end())) return false;
+        const std::vector<uintptr_t> entries(expected.begin(), expected.end());
+        if (walkList(h, k, expected.size() + 1) != entries) return false;
     }
     return true;
 }

@@ -121,7 +121,7 @@ inline bool patternIntact(const void *block, uint32_t n, uint32_t tag) {
 }
 
 /* The class word stored below a block, and the address a class word names. */
-inline uintptr_t classWordAt(uintptr_t block) { return *reinterpret_cast<const uintptr_t *>(block - sizeof(uintptr_t)); }
+inline uintptr_t classWordAt(uintptr_t block) { return reinterpret_cast<const uintptr_t *>(block)[-1]; }
 inline uintptr_t slotAddress(const ShmHeader *h, int k) { return reinterpret_cast<uintptr_t>(&h->freeList[k]); }
 
 /* A copy of the free-list heads, to prove that an operation changed nothing. */
