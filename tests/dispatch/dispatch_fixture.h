@@ -1,41 +1,69 @@
-/* Set-up shared by the dispatch-loop tests: a selector context, the scripted
- * host, descriptors placed at chosen numbers and a callback that logs. */
+/* Set-up shared by the dispatch-loop tests. The scripted host: the ten host
+ * functions the select loop calls are defined (strongly) in scripted_host.cpp
+ * and behave as the state below says; the calls that shape a pass are
+ * appended to a log, so tests can check the exact order. The fixture: a
+ * selector context, descriptors at chosen numbers, callbacks that log. */
 #ifndef QORBU_TESTS_DISPATCH_FIXTURE_H
 #define QORBU_TESTS_DISPATCH_FIXTURE_H
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
+#include <sys/socket.h>
 #include <time.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <deque>
+#include <functional>
 #include <string>
 #include <vector>
 
-#include "scripted_host.h"
+#include "selector/host.h"
 #include "selector/sel_private.h"
+
+namespace scripted {
+
+struct Host {
+    SelHostScheduler scheduler{{}, {}, {}, -1, {}};
+    SelHostContext context{&scheduler};
+    SelHostTask timedTasks[4];      /* storage for the first task of each timed list */
+    struct timeval now = {1000, 0}; /* the host clock, as pal_time_tzcurrent reports it */
+    std::deque<std::pair<int, std::function<void()>>> queue; /* task id, what thread_call runs */
+    std::function<void()> onSelectNb; /* run by thread_select_nb */
+    int snmpCount = 0;  /* what snmp_select_info reports as the count */
+    fd_set snmpSet{};   /* descriptors it adds to the caller's set */
+    bool giveSnmpTimeout = false;
+    struct timeval snmpTimeout = {0, 0};
+    std::vector<std::string> log;
+    /* Checks of the loop's side of the contract. */
+    int cmpCalls = 0;
+    std::vector<struct timeval> subArgs; /* first argument of each timeval_sub */
+    const void *lastFetchRecord = nullptr;
+    bool callSawFetchedRecord = true;
+    bool snmpInputsAsAgreed = true; /* count 0, block 1 and an empty set (outside the EBADF probe) */
+    fd_set *lastSnmpReadArg = nullptr;
+    fd_set lastSnmpReadSet{};
+};
+
+Host &host();
+void reset();
+/* The first task of timed list i, due at the given host time. */
+void set_timed(int list, struct timeval when);
+void log(const std::string &entry);
+inline long times(const std::string &entry) { return std::count(host().log.begin(), host().log.end(), entry); }
+
+} // namespace scripted
 
 namespace dispatch_test {
 
-/* qemu-i386 (7.2) aborts the process when another thread signals a thread
- * blocked in epoll_wait; the i386 guests skip that one case. */
-#if defined(QORBU_TESTS_EMULATED) && defined(__i386__)
-inline constexpr bool kNoCrossThreadSignals = true;
-#else
-inline constexpr bool kNoCrossThreadSignals = false;
-#endif
+using Log = std::vector<std::string>;
 
-inline const char *event_name(unsigned event) {
-    switch (event) {
-    case SEL_READ: return "r";
-    case SEL_WRITE: return "w";
-    case SEL_EXCEPT: return "x";
-    default: return "?";
-    }
-}
+inline std::string cb(int fd, const char *event) { return "cb:" + std::to_string(fd) + ":" + event; }
 
 /* Logs "cb:<fd>:<r|w|x>" to the scripted host's log. */
 inline int log_callback(int fd, unsigned event, void *, SelFdEntry *) {
-    scripted::log("cb:" + std::to_string(fd) + ":" + event_name(event));
+    scripted::log(cb(fd, event == SEL_READ ? "r" : event == SEL_WRITE ? "w" : event == SEL_EXCEPT ? "x" : "?"));
     return 0;
 }
 
@@ -44,26 +72,35 @@ inline int log_timer(SelTimer *t) {
     return 0;
 }
 
-inline double seconds_since(const struct timespec &start) {
-    struct timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return static_cast<double>(now.tv_sec - start.tv_sec) + (now.tv_nsec - start.tv_nsec) / 1e9;
-}
-
 inline struct timespec monotonic_now() {
     struct timespec now;
     clock_gettime(CLOCK_MONOTONIC, &now);
     return now;
 }
 
+inline double seconds_since(const struct timespec &start) {
+    const struct timespec now = monotonic_now();
+    return static_cast<double>(now.tv_sec - start.tv_sec) + (now.tv_nsec - start.tv_nsec) / 1e9;
+}
+
+inline volatile sig_atomic_t g_handled = 0;
+inline void count_signal(int) { g_handled = g_handled + 1; }
+
+/* SIGUSR1 handled by count_signal and registered with the selector. */
+inline void register_counted_sigusr1() {
+    struct sigaction sa {};
+    sa.sa_handler = count_signal;
+    ASSERT_EQ(sigaction(SIGUSR1, &sa, nullptr), 0);
+    ASSERT_EQ(SelAddSignal(SIGUSR1), 0);
+    g_handled = 0;
+}
+
 /* A pipe whose read end sits at a chosen descriptor number (when given). */
-class Pipe {
-public:
+struct Pipe {
     explicit Pipe(int readAt = -1) {
         int fds[2];
         EXPECT_EQ(pipe(fds), 0);
-        r = fds[0];
-        w = fds[1];
+        r = fds[0], w = fds[1];
         if (readAt >= 0 && readAt != r) {
             EXPECT_EQ(dup2(r, readAt), readAt);
             close(r);
@@ -71,21 +108,22 @@ public:
         }
     }
     ~Pipe() {
-        if (r >= 0) close(r);
-        if (w >= 0) close(w);
+        for (int fd : {r, w})
+            if (fd >= 0) close(fd);
     }
     Pipe(const Pipe &) = delete;
-    Pipe &operator=(const Pipe &) = delete;
     void fill() { EXPECT_EQ(write(w, "x", 1), 1); }
-    void drain() {
-        char buf[64];
-        EXPECT_GT(read(r, buf, sizeof buf), 0);
-    }
-    void close_writer() {
-        close(w);
-        w = -1;
-    }
     int r = -1, w = -1;
+};
+
+/* A connected pair whose first end is both readable (one byte) and writable. */
+struct SocketPair {
+    SocketPair() {
+        EXPECT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, sv), 0);
+        EXPECT_EQ(write(sv[1], "x", 1), 1);
+    }
+    ~SocketPair() { close(sv[0]), close(sv[1]); }
+    int sv[2] = {-1, -1};
 };
 
 class DispatchTest : public ::testing::Test {
@@ -93,19 +131,24 @@ protected:
     void SetUp() override {
         scripted::reset();
         ASSERT_EQ(SelInit(), 0);
-        ctx = SelCurrentContext();
-        ASSERT_NE(ctx, nullptr);
+        ASSERT_NE(ctx = SelCurrentContext(), nullptr);
     }
     void TearDown() override { SelSetZG(nullptr); }
 
     /* Host hooks on, with the scripted host's context. */
-    void use_host() { SelSetZG(&scripted::host().context); }
-    const std::vector<std::string> &log() { return scripted::host().log; }
-    void clear_log() { scripted::host().log.clear(); }
-    std::vector<std::string> callbacks_logged() {
-        std::vector<std::string> out;
-        for (const auto &e : log())
-            if (e.rfind("cb:", 0) == 0) out.push_back(e);
+    static void use_host() { SelSetZG(&scripted::host().context); }
+    static int watch(int fd, unsigned events = SEL_READ, SelFdCallback callback = log_callback, void *arg = nullptr) {
+        return SelAddFD(fd, events, 0, callback, arg);
+    }
+    static void give_snmp_timeout(long sec, long usec) {
+        scripted::host().giveSnmpTimeout = true;
+        scripted::host().snmpTimeout = {sec, usec};
+    }
+    static const Log &log() { return scripted::host().log; }
+    static void clear_log() { scripted::host().log.clear(); }
+    static Log callbacks_logged() {
+        Log out;
+        std::copy_if(log().begin(), log().end(), std::back_inserter(out), [](auto &e) { return e.rfind("cb:", 0) == 0; });
         return out;
     }
     /* The pass would wait for the reaper's timer otherwise; a short timer

@@ -1,16 +1,20 @@
 /* zarn_select: select()'s results from one pass of the thread's selector. */
-#include <signal.h>
-#include <sys/socket.h>
-
 #include <algorithm>
 #include <cerrno>
+#include <initializer_list>
 
 #include "dispatch_fixture.h"
 
 using namespace dispatch_test;
-using Log = std::vector<std::string>;
 
 namespace {
+
+fd_set set_of(std::initializer_list<int> fds) {
+    fd_set set;
+    FD_ZERO(&set);
+    for (int fd : fds) FD_SET(fd, &set);
+    return set;
+}
 
 class ZarnSelect : public DispatchTest {
 protected:
@@ -31,17 +35,10 @@ protected:
     int timersBefore = 0;
 };
 
-std::string cb(int fd, const char *event) { return "cb:" + std::to_string(fd) + ":" + event; }
-
-volatile sig_atomic_t g_handled = 0;
-void count_signal(int) { g_handled = g_handled + 1; }
-
 } // namespace
 
 TEST_F(ZarnSelect, RefusesDescriptorCountsOutsideTheSetSize) {
-    fd_set r;
-    FD_ZERO(&r);
-    FD_SET(3, &r);
+    fd_set r = set_of({3});
     struct timeval zero = {0, 0};
     for (int nfds : {-1, FD_SETSIZE + 1}) {
         errno = 0;
@@ -52,58 +49,40 @@ TEST_F(ZarnSelect, RefusesDescriptorCountsOutsideTheSetSize) {
     EXPECT_EQ(zarn_select(FD_SETSIZE, nullptr, nullptr, nullptr, &zero), 0);
 }
 
-TEST_F(ZarnSelect, ReportsReadyDescriptorsAndClearsEverythingElse) {
+TEST_F(ZarnSelect, ReportsEachReadyConditionAndClearsEverythingElse) {
     Pipe ready(40), idle(41);
     ready.fill();
-    fd_set r;
-    FD_ZERO(&r);
-    FD_SET(40, &r);
-    FD_SET(41, &r);
-    FD_SET(900, &r); /* above nfds */
+    fd_set r = set_of({40, 41, 900}); /* 900 is above nfds */
     struct timeval timeout = {20, 0};
     EXPECT_EQ(zarn_select(42, &r, nullptr, nullptr, &timeout), 1);
     EXPECT_TRUE(FD_ISSET(40, &r));
     EXPECT_FALSE(FD_ISSET(41, &r));
     EXPECT_FALSE(FD_ISSET(900, &r));
     expect_registry_clean();
-}
 
-TEST_F(ZarnSelect, ReadableAndWritableDescriptorCountsTwice) {
-    int sv[2];
-    ASSERT_EQ(socketpair(AF_UNIX, SOCK_STREAM, 0, sv), 0);
-    ASSERT_EQ(write(sv[1], "x", 1), 1);
-    fd_set r, w, e;
-    FD_ZERO(&r);
-    FD_ZERO(&w);
-    FD_ZERO(&e);
-    FD_SET(sv[0], &r);
-    FD_SET(sv[0], &w);
-    FD_SET(sv[0], &e);
-    EXPECT_EQ(zarn_select(sv[0] + 1, &r, &w, &e, nullptr), 2);
-    EXPECT_TRUE(FD_ISSET(sv[0], &r));
-    EXPECT_TRUE(FD_ISSET(sv[0], &w));
-    EXPECT_FALSE(FD_ISSET(sv[0], &e));
+    SocketPair s; /* readable and writable: counted twice */
+    const int fd = s.sv[0];
+    fd_set w = set_of({fd}), e = set_of({fd});
+    r = set_of({fd});
+    EXPECT_EQ(zarn_select(fd + 1, &r, &w, &e, nullptr), 2);
+    EXPECT_TRUE(FD_ISSET(fd, &r));
+    EXPECT_TRUE(FD_ISSET(fd, &w));
+    EXPECT_FALSE(FD_ISSET(fd, &e));
     expect_registry_clean();
-    close(sv[0]);
-    close(sv[1]);
 }
 
-TEST_F(ZarnSelect, ZeroTimeoutReturnsZeroWhenNothingIsReady) {
+TEST_F(ZarnSelect, ZeroTimeoutReturnsAtOnceAndNoSetsSleepForTheTimeout) {
     Pipe idle(40);
-    fd_set r;
-    FD_ZERO(&r);
-    FD_SET(40, &r);
-    struct timeval zero = {0, 0};
-    const auto start = monotonic_now();
-    EXPECT_EQ(zarn_select(41, &r, nullptr, nullptr, &zero), 0);
+    fd_set r = set_of({40});
+    struct timeval timeout = {0, 0};
+    auto start = monotonic_now();
+    EXPECT_EQ(zarn_select(41, &r, nullptr, nullptr, &timeout), 0);
     EXPECT_LT(seconds_since(start), 8.0);
     EXPECT_FALSE(FD_ISSET(40, &r));
     expect_registry_clean();
-}
 
-TEST_F(ZarnSelect, NoSetsSleepsForTheTimeout) {
-    struct timeval timeout = {0, 200000};
-    const auto start = monotonic_now();
+    timeout = {0, 200000};
+    start = monotonic_now();
     EXPECT_EQ(zarn_select(0, nullptr, nullptr, nullptr, &timeout), 0);
     const double slept = seconds_since(start);
     EXPECT_GE(slept, 0.199);
@@ -114,9 +93,7 @@ TEST_F(ZarnSelect, NoSetsSleepsForTheTimeout) {
 TEST_F(ZarnSelect, AnotherTimerOfTheThreadEndsTheCallEarly) {
     arm_guard_timer(100);
     Pipe idle(40);
-    fd_set r;
-    FD_ZERO(&r);
-    FD_SET(40, &r);
+    fd_set r = set_of({40});
     struct timeval timeout = {30, 0};
     const auto start = monotonic_now();
     EXPECT_EQ(zarn_select(41, &r, nullptr, nullptr, &timeout), 0);
@@ -129,11 +106,8 @@ TEST_F(ZarnSelect, OwnersRegistrationIsServedAndKept) {
     Pipe owned(40), asked(41);
     owned.fill();
     asked.fill();
-    ASSERT_EQ(SelAddFD(40, SEL_READ, 0, log_callback, &owned), 0);
-    fd_set r;
-    FD_ZERO(&r);
-    FD_SET(40, &r);
-    FD_SET(41, &r);
+    ASSERT_EQ(watch(40, SEL_READ, log_callback, &owned), 0);
+    fd_set r = set_of({40, 41});
     struct timeval timeout = {20, 0};
     EXPECT_EQ(zarn_select(42, &r, nullptr, nullptr, &timeout), 1);
     EXPECT_TRUE(FD_ISSET(41, &r));
@@ -145,15 +119,10 @@ TEST_F(ZarnSelect, OwnersRegistrationIsServedAndKept) {
 }
 
 TEST_F(ZarnSelect, InterruptedPassFailsWithItsErrnoAfterCleaningUp) {
-    struct sigaction sa {};
-    sa.sa_handler = count_signal;
-    ASSERT_EQ(sigaction(SIGUSR1, &sa, nullptr), 0);
-    ASSERT_EQ(SelAddSignal(SIGUSR1), 0);
+    register_counted_sigusr1();
     ASSERT_EQ(raise(SIGUSR1), 0); /* pending until the blocking wait */
     Pipe idle(40);
-    fd_set r;
-    FD_ZERO(&r);
-    FD_SET(40, &r);
+    fd_set r = set_of({40});
     struct timeval timeout = {30, 0};
     errno = 0;
     EXPECT_EQ(zarn_select(41, &r, nullptr, nullptr, &timeout), -1);
