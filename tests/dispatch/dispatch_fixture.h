@@ -10,10 +10,10 @@
 #include <gtest/gtest.h>
 #include <signal.h>
 #include <sys/socket.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <chrono>
 #include <deque>
 #include <functional>
 #include <string>
@@ -29,7 +29,7 @@ struct Host {
     SelHostContext context{&scheduler};
     SelHostTask timedTasks[4];      /* storage for the first task of each timed list */
     struct timeval now = {1000, 0}; /* the host clock, as pal_time_tzcurrent reports it */
-    std::deque<std::pair<int, std::function<void()>>> queue; /* task id, what thread_call runs */
+    std::deque<int> queue;          /* ids of the queued tasks */
     std::function<void()> onSelectNb; /* run by thread_select_nb */
     int snmpCount = 0;  /* what snmp_select_info reports as the count */
     fd_set snmpSet{};   /* descriptors it adds to the caller's set */
@@ -72,16 +72,8 @@ inline int log_timer(SelTimer *t) {
     return 0;
 }
 
-inline struct timespec monotonic_now() {
-    struct timespec now;
-    clock_gettime(CLOCK_MONOTONIC, &now);
-    return now;
-}
-
-inline double seconds_since(const struct timespec &start) {
-    const struct timespec now = monotonic_now();
-    return static_cast<double>(now.tv_sec - start.tv_sec) + (now.tv_nsec - start.tv_nsec) / 1e9;
-}
+using Clock = std::chrono::steady_clock;
+inline double seconds_since(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
 
 inline volatile sig_atomic_t g_handled = 0;
 inline void count_signal(int) { g_handled = g_handled + 1; }

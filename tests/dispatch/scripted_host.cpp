@@ -1,5 +1,6 @@
 #include <cstring>
 #include <mutex>
+#include <optional>
 
 #include "dispatch_fixture.h"
 
@@ -14,7 +15,7 @@ struct TaskRecord {
 static_assert(sizeof(TaskRecord) == SEL_HOST_TASK_SIZE);
 constexpr unsigned kTaskMagic = 0x7a61736bu;
 
-Host *g_host = nullptr;
+std::optional<Host> g_host;
 /* Passes of several threads may call the host at once; a task run by
  * thread_call may itself run a pass, hence recursive. */
 std::recursive_mutex g_lock;
@@ -29,19 +30,11 @@ struct Call {
 };
 } // namespace
 
-Host &host() {
-    if (!g_host) reset();
-    return *g_host;
-}
-
-void reset() {
-    delete g_host;
-    g_host = new Host();
-}
+Host &host() { return g_host ? *g_host : g_host.emplace(); }
+void reset() { g_host.emplace(); }
 
 void set_timed(int list, struct timeval when) {
-    host().timedTasks[list] = SelHostTask{nullptr, when};
-    host().scheduler.timed[list] = &host().timedTasks[list];
+    host().scheduler.timed[list] = &(host().timedTasks[list] = SelHostTask{nullptr, when});
 }
 
 void log(const std::string &entry) {
@@ -62,7 +55,7 @@ int thread_fetch_queued(void *hostContext, void *task) {
         c.h.log.push_back("empty");
         return 0;
     }
-    scripted::TaskRecord record{scripted::kTaskMagic, c.h.queue.front().first, {}};
+    scripted::TaskRecord record{scripted::kTaskMagic, c.h.queue.front(), {}};
     memset(record.rest, 0xa5, sizeof record.rest);
     memcpy(task, &record, sizeof record); /* the whole 36 bytes */
     c.h.lastFetchRecord = task;
@@ -73,12 +66,10 @@ int thread_call(void *task) {
     Call c;
     scripted::TaskRecord record;
     memcpy(&record, task, sizeof record);
-    auto queued = std::move(c.h.queue.front());
-    c.h.queue.pop_front();
-    if (task != c.h.lastFetchRecord || record.magic != scripted::kTaskMagic || queued.first != record.id)
+    if (task != c.h.lastFetchRecord || record.magic != scripted::kTaskMagic || c.h.queue.front() != record.id)
         c.h.callSawFetchedRecord = false;
+    c.h.queue.pop_front();
     c.h.log.push_back("call:" + std::to_string(record.id));
-    if (queued.second) queued.second();
     return 0;
 }
 
