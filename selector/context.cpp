@@ -55,10 +55,6 @@ void SelFreeContext(void *context) {
     free(ctx);
 }
 
-SelContext *SelCurrentContext(void) {
-    return static_cast<SelContext *>(pthread_getspecific(sel_tl_key));
-}
-
 int SelInit(void) {
     pthread_once(&sel_tl_once, SelCreateKey);
     if (sel_tl_key == kNoKey)

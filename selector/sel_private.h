@@ -39,7 +39,11 @@ typedef struct SelContext {
 
 /* Internal operations, hidden from the library's users but linkable by the
  * white-box tests (they link the static archive of the same objects). */
-QORBU_HIDDEN SelContext *SelCurrentContext(void);
+/* The calling thread's context: every timer and descriptor call looks it up,
+ * so the lookup is inline. */
+static inline SelContext *SelCurrentContext(void) {
+    return (SelContext *)pthread_getspecific(sel_tl_key);
+}
 QORBU_HIDDEN void SelCreateKey(void);
 QORBU_HIDDEN void SelFreeContext(void *context);
 
