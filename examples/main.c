@@ -201,17 +201,6 @@ static int parse_options(int argc, char **argv, DemoOptions *options, char *name
 
 /* ---- the segment ---------------------------------------------------------- */
 
-/* Refuses an address range that something in this process already uses:
- * the segment is mapped there with MAP_FIXED, which would replace it. */
-static int range_is_free(uintptr_t start, size_t length)
-{
-    void *probe = mmap((void *)start, length, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_FIXED_NOREPLACE, -1, 0);
-    if (probe == MAP_FAILED)
-        return 0;
-    munmap(probe, length);
-    return probe == (void *)start; /* kernels before 4.17 treat the flag as a hint */
-}
-
 static int segment_exists(const char *name)
 {
     char object[256];
@@ -226,19 +215,18 @@ static int segment_exists(const char *name)
 static int create_segment(Demo *demo)
 {
     const DemoOptions *options = &demo->options;
-    const size_t page = (size_t)ShmOverhead();
-    const size_t length = page + ((options->segmentSize + page - 1) / page) * page;
     if (segment_exists(options->segmentName)) {
         fprintf(stderr, "qorbu-demo: segment %s already exists (another qorbu-demo? remove it with "
                         "'qorbu-shm unlink %s')\n", options->segmentName, options->segmentName);
         return -1;
     }
-    if (!range_is_free(options->segmentAddress - page, length)) {
+    demo->segment = ShmCreate(options->segmentName, (void *)options->segmentAddress, options->segmentSize);
+    if (!demo->segment && errno == EEXIST) { /* the library never maps over memory in use */
+        ShmUnlink(options->segmentName);        /* the object it made stays unsized: remove it */
         fprintf(stderr, "qorbu-demo: the address range at %#lx is in use; choose --segment-address\n",
-                (unsigned long)(options->segmentAddress - page));
+                (unsigned long)(options->segmentAddress - (uintptr_t)ShmOverhead()));
         return -1;
     }
-    demo->segment = ShmCreate(options->segmentName, (void *)options->segmentAddress, options->segmentSize);
     if (!demo->segment) {
         fprintf(stderr, "qorbu-demo: cannot create segment %s: %s\n", options->segmentName, strerror(errno));
         return -1;

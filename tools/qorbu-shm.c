@@ -155,17 +155,6 @@ static int peek_header(const char *name, Peek *peek)
     return EXIT_OK;
 }
 
-/* The attach maps the segment with MAP_FIXED at its recorded base, which
- * would replace anything this process has there. */
-static int range_is_free(uintptr_t start, size_t length)
-{
-    void *probe = mmap((void *)start, length, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_FIXED_NOREPLACE, -1, 0);
-    if (probe == MAP_FAILED)
-        return 0;
-    munmap(probe, length);
-    return probe == (void *)start; /* kernels before 4.17 take the flag as a hint */
-}
-
 static int busy_error(const char *name)
 {
     return fail(EXIT_BUSY, "segment '%s' is busy: an allocation or free is running or was interrupted", name);
@@ -194,12 +183,12 @@ static int attach(const char *name, int mode, ShmHandle **handle, Peek *peekOut)
         *peekOut = peek;
     if (mode == O_RDONLY && peek.busy)
         return peekOut ? kBusyUnreported : busy_error(name);
-    if (!range_is_free(peek.base, peek.size))
-        return fail(EXIT_FAILED, "cannot attach segment '%s': its range %#" PRIxPTR "..%#" PRIxPTR
-                    " is in use in this process", name, peek.base, peek.base + peek.size);
     *handle = ShmOpen(name, mode);
     if (*handle)
         return EXIT_OK;
+    if (errno == EEXIST) /* the library never maps over memory in use */
+        return fail(EXIT_FAILED, "cannot attach segment '%s': its range %#" PRIxPTR "..%#" PRIxPTR
+                    " is in use in this process", name, peek.base, peek.base + peek.size);
     if (errno == ENOENT)
         return fail(EXIT_NO_SEGMENT, "no segment named '%s'", name);
     if (errno == EBUSY)
@@ -273,12 +262,12 @@ static int cmd_create(int argc, char **argv)
         close(existing);
         return fail(EXIT_EXISTS, "segment '%s' exists already", argv[0]);
     }
-    const size_t page = (size_t)ShmOverhead();
-    const size_t length = page + (size + page - 1) / page * page;
-    if (address && !range_is_free((uintptr_t)address - page, length))
+    ShmHandle *handle = ShmCreate(argv[0], (void *)(uintptr_t)address, (uint32_t)size);
+    if (!handle && errno == EEXIST) { /* the library never maps over memory in use */
+        ShmUnlink(argv[0]);               /* the object it made stays unsized: remove it */
         return fail(EXIT_FAILED, "cannot create segment '%s' at %#llx: the range is in use in this process",
                     argv[0], address);
-    ShmHandle *handle = ShmCreate(argv[0], (void *)(uintptr_t)address, (uint32_t)size);
+    }
     if (!handle)
         return fail(EXIT_FAILED, "cannot create segment '%s': %s", argv[0], error_text(errno));
     const ShmHeader *header = header_of(handle);
