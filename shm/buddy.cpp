@@ -65,11 +65,11 @@ int classNamedBy(const ShmHeader *h, uintptr_t word) {
  * the handle's mapping. */
 bool ownsBlock(const ShmHandle *handle, uintptr_t p) {
     const uintptr_t base = reinterpret_cast<uintptr_t>(handle->base);
-    const uintptr_t dataStart = base + pageSize();
+    const uintptr_t page = pageSize();
     const uintptr_t end = base + handle->size;
-    if (p < dataStart || p >= end || p % kSmallestBlock != 0) return false;
+    if (p < base + page || p >= end || p % kSmallestBlock != 0) return false;
     const uintptr_t word = *classWordOf(p);
-    if ((word & ~(pageSize() - 1)) != base) return false;
+    if ((word & ~(page - 1)) != base) return false;
     const int k = classNamedBy(handle->base, word);
     return k >= 0 && blockSize(k) <= end - p;
 }

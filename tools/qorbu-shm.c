@@ -357,7 +357,8 @@ static int cmd_alloc(int argc, char **argv)
     return status;
 }
 
-/* The library trusts the pointer it is given; the tool checks it first. */
+/* The library refuses a foreign pointer with a message and ends the process
+ * on a double free; the tool checks first so that both get an exit code. */
 static int check_block(const ShmHeader *header, uintptr_t address, const char *text)
 {
     const uintptr_t dataStart = header->base + (uintptr_t)ShmOverhead();
