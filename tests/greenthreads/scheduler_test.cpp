@@ -227,7 +227,7 @@ TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds)
         EXPECT_EQ(trace, "YYYT");
         EXPECT_EQ(live_threads, 0);
         EXPECT_EQ(wake.timer.heapIndex, 0u);
-        EXPECT_EQ(wake.thread->runnable, 0);
+        EXPECT_EQ(wake.thread->runnable, kFinished);
         EXPECT_EQ(free_threads, wake.thread) << "the timer's thread finished last";
     }
     DeInitEpoll();
