@@ -34,7 +34,7 @@
 struct Greenthread {
     ucontext_t context; /* uc_stack names the whole mapping, guard page included */
     Greenthread *next;  /* run queue link; free-list link once finished */
-    int32_t runnable;   /* 1 while running or queued, 0 while blocked or finished */
+    int32_t runnable;   /* kRunnable, kBlocked or kFinished (below) */
     GreenthreadEntry entry;
     void *arg;
 #ifdef QORBU_GT_TSAN
@@ -54,6 +54,13 @@ static_assert(sizeof(Greenthread) == sizeof(ucontext_t) + 16);
 #endif
 
 namespace qorbu::gt {
+
+/* Values of Greenthread::runnable. A finished record has a state of its own:
+ * it sits on the free list through the link the run queue uses, so a wakeup
+ * must never queue it. */
+inline constexpr int32_t kBlocked = 0;
+inline constexpr int32_t kRunnable = 1;
+inline constexpr int32_t kFinished = -1;
 
 /* Usable stack of every green thread, before rounding up to whole pages. */
 inline constexpr size_t kStackSize = 16384;

@@ -9,7 +9,7 @@
 #include <unistd.h>
 
 #include "greenthreads/greenthread_private.h"
-#include "selector/sel.h"
+#include "selector/sel_private.h"
 
 #ifdef QORBU_GT_ASAN
 #include <sanitizer/common_interface_defs.h>
@@ -131,7 +131,7 @@ void undo_switch(Greenthread *self, Greenthread *next, Greenthread *tailBefore, 
             run_queue_head = nullptr;
     }
     run_queue_push_front(next);
-    self->runnable = 1;
+    self->runnable = kRunnable;
     current_thread = self;
 }
 
@@ -144,11 +144,11 @@ void switch_to_next(bool finishing)
     if (next == nullptr) {
         /* Only a runnable caller can be alone; a caller that tried to block
          * with nobody to switch to keeps running rather than hang. */
-        self->runnable = 1;
+        self->runnable = kRunnable;
         return;
     }
     Greenthread *const tailBefore = run_queue_tail;
-    const bool selfQueued = self->runnable != 0;
+    const bool selfQueued = self->runnable == kRunnable;
     if (selfQueued)
         run_queue_append(self);
     current_thread = next;
@@ -156,10 +156,13 @@ void switch_to_next(bool finishing)
         undo_switch(self, next, tailBefore, selfQueued);
 }
 
+/* Every green thread waits: in epoll mode the pass sleeps until a
+ * descriptor or a signal wakes it even when no timer is armed, rather than
+ * come straight back and spin. */
 void wait_in_selector()
 {
     if (GetEpollFd() != 0)
-        SelEpoll();
+        qorbu::sel::epoll_pass(true);
     else
         SelSelect();
 }
@@ -237,7 +240,7 @@ void greenthread_start()
      * off the end would end the whole process (the context has no link),
      * so a switch that failed is tried again. */
     for (;;) {
-        self->runnable = 0;
+        self->runnable = kFinished;
         switch_to_next(true);
     }
 }
@@ -264,7 +267,7 @@ void greenthreads_init(void)
     auto *self = static_cast<Greenthread *>(calloc(1, sizeof(Greenthread)));
     if (self == nullptr)
         return;
-    self->runnable = 1;
+    self->runnable = kRunnable;
 #ifdef QORBU_GT_TSAN
     self->tsanFiber = __tsan_get_current_fiber();
 #endif
@@ -286,7 +289,7 @@ Greenthread *greenthread_create(GreenthreadEntry entry, void *arg)
     thread->entry = entry;
     thread->arg = arg;
     makecontext(&thread->context, greenthread_start, 0);
-    thread->runnable = 1;
+    thread->runnable = kRunnable;
     run_queue_append(thread);
     ++live_threads;
     return thread;
@@ -306,17 +309,18 @@ void greenthread_block(void)
     /* The main context never blocks: it is the one that waits in the
      * selector, so for it blocking is just taking a turn. */
     if (self != main_thread)
-        self->runnable = 0;
+        self->runnable = kBlocked;
     switch_to_next(false);
 }
 
 void greenthread_wakeup(Greenthread *thread)
 {
     /* Null is what a selector callback holds when it was armed before
-     * greenthreads_init: there is no thread to wake. */
-    if (thread == nullptr || thread->runnable != 0)
+     * greenthreads_init: there is no thread to wake. Only a blocked thread
+     * is queued; a finished one stays on the free list. */
+    if (thread == nullptr || thread->runnable != kBlocked)
         return;
-    thread->runnable = 1;
+    thread->runnable = kRunnable;
     run_queue_append(thread);
 }
 

@@ -36,14 +36,28 @@ unsigned int selector_event(uint32_t epollEvents) {
     return SEL_EXCEPT;
 }
 
-void dispatch_events(SelContext *ctx, const struct epoll_event *events, int count) {
-    for (int i = 0; i < count; ++i) {
+/* Dispatches the batch in order. SelRemFD drops a removed descriptor's
+ * events still to come (its number may be registered anew meanwhile), and
+ * once a callback has run a nested pass, which served what was left, the
+ * rest of the batch is stale. */
+void dispatch_events(SelContext *ctx, struct epoll_event *events, int count, uint32_t pass) {
+    struct epoll_event *const outerBatch = ctx->epollBatch;
+    const int32_t outerNext = ctx->epollBatchNext, outerEnd = ctx->epollBatchEnd;
+    ctx->epollBatch = events;
+    ctx->epollBatchEnd = count;
+    for (int i = 0; i < count && ctx->passCount == pass; ++i) {
+        ctx->epollBatchNext = i + 1;
         const int fd = events[i].data.fd;
-        SelFdEntry *entry = SelFdSlot(ctx, fd);
+        SelFdEntry *entry = SelFdFind(ctx, fd);
         if (!entry || entry->events == 0) continue;
         entry->callback(fd, selector_event(events[i].events), entry->arg, entry);
     }
+    ctx->epollBatch = outerBatch;
+    ctx->epollBatchNext = outerNext;
+    ctx->epollBatchEnd = outerEnd;
 }
+
+bool timer_armed(const SelContext *ctx) { return ctx->timerCount > 0 && ctx->timerHeap[1]; }
 
 } // namespace
 
@@ -105,8 +119,11 @@ extern "C" QORBU_API void DeInitEpoll(void) { epoll_fd.store(0, std::memory_orde
 
 extern "C" QORBU_API int GetEpollFd(void) { return current_epoll_fd(); }
 
-extern "C" QORBU_API int SelEpoll(void) {
+namespace qorbu::sel {
+
+int epoll_pass(bool sleepWithoutTimer) {
     SelContext *ctx = SelCurrentContext();
+    const uint32_t pass = begin_pass(ctx);
     const int epfd = current_epoll_fd();
     struct epoll_event events[kEpollBatch];
 
@@ -116,9 +133,14 @@ extern "C" QORBU_API int SelEpoll(void) {
         struct timespec now;
         SelGetTime(&now);
         if (SelRunTimers(ctx) > 0) return 0;
-        n = wait_blocking(ctx, epfd, events, epoll_timeout_ms(ctx, now));
+        const int timeoutMs = sleepWithoutTimer && !timer_armed(ctx) ? -1 : epoll_timeout_ms(ctx, now);
+        n = wait_blocking(ctx, epfd, events, timeoutMs);
         if (n < 0) return handle_epoll_failure();
     }
-    dispatch_events(ctx, events, n);
+    dispatch_events(ctx, events, n, pass);
     return run_timers_and_return(ctx);
 }
+
+} // namespace qorbu::sel
+
+extern "C" QORBU_API int SelEpoll(void) { return epoll_pass(false); }

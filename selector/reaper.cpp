@@ -13,11 +13,13 @@ extern "C" {
 QORBU_API SelTimer fd_timer;
 }
 
-namespace {
-
+namespace qorbu::sel {
 // fd_timer is one record, and a timer lives in one heap at a time: the first
 // context to start gets it, and it passes on when that context's thread ends.
 std::atomic<SelContext *> reaper_owner{nullptr};
+} // namespace qorbu::sel
+
+namespace {
 
 bool is_idle(const SelFdEntry &entry, const struct timeval &now) {
     // A signed 32-bit difference of whole seconds: a clock set back closes nothing.

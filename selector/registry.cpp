@@ -1,6 +1,7 @@
 // The per-thread descriptor registry: one entry per descriptor number, the
 // select-mode interest sets and nfds, or the process-wide epoll instance.
 #include <errno.h>
+#include <fcntl.h>
 #include <stdint.h>
 #include <stdlib.h>
 #include <string.h>
@@ -69,6 +70,19 @@ void lower_nfds(SelContext *ctx, int fd) {
     ctx->nfds = i + 1;
 }
 
+bool is_open_descriptor(int fd) { return fcntl(fd, F_GETFD) != -1 || errno != EBADF; }
+
+// Events of the running epoll batch that are still to come for fd are not
+// dispatched: they were meant for the registration just removed.
+void drop_pending_events(SelContext *ctx, int fd) {
+    struct epoll_event *batch = ctx->epollBatch;
+    if (batch == nullptr)
+        return;
+    for (int i = ctx->epollBatchNext; i < ctx->epollBatchEnd; ++i)
+        if (batch[i].data.fd == fd)
+            batch[i].data.fd = -1;
+}
+
 int add_to_epoll(int epfd, int fd, unsigned events) {
     struct epoll_event ev;
     memset(&ev, 0, sizeof ev);
@@ -104,12 +118,19 @@ SelFdEntry *SelFdSlot(SelContext *ctx, int fd) {
 
 int SelAddFD(int fd, unsigned int events, int idleTracked, SelFdCallback callback, void *arg) {
     const int epfd = current_epoll_fd();
-    // A select-mode descriptor must fit in an fd_set.
-    if ((events & ~kRegistrableEvents) != 0 || fd < 0 || (epfd == 0 && fd >= kSelectSetSize)) {
+    // A select-mode descriptor must fit in an fd_set; every event needs a callback.
+    if ((events & ~kRegistrableEvents) != 0 || fd < 0 || callback == nullptr ||
+        (epfd == 0 && fd >= kSelectSetSize)) {
         errno = EINVAL;
         return -1;
     }
     SelContext *ctx = SelCurrentContext();
+    // Epoll mode takes any number: one that is not an open descriptor is
+    // refused, as epoll would refuse it, before the table grows to reach it.
+    if (epfd != 0 && fd >= ctx->fdTableSize && !is_open_descriptor(fd)) {
+        errno = EBUSY;
+        return -1;
+    }
     SelFdEntry *entry = SelFdSlot(ctx, fd);
     if (entry == nullptr)
         return -1;
@@ -139,22 +160,24 @@ int SelRemFD(int fd) {
         errno = EINVAL;
         return -1;
     }
-    SelFdEntry *entry = SelFdSlot(ctx, fd);
-    if (entry == nullptr)
-        return -1;
-    // Also drops SEL_IN_CALLBACK: a running dispatch step restores nothing.
-    entry->events = 0;
+    // A descriptor beyond the table has no entry to free: nothing grows.
+    if (SelFdEntry *entry = SelFdFind(ctx, fd))
+        entry->events = 0; // also drops SEL_IN_CALLBACK: a running dispatch step restores nothing
 
+    // Whichever mode the descriptor was registered in, no trace of it stays
+    // in the select-mode sets: the reaper and later select passes go by them.
+    if (fd < ctx->nfds) {
+        clear_everywhere(ctx, fd);
+        if (ctx->nfds == fd + 1)
+            lower_nfds(ctx, fd);
+    }
     if (epfd != 0) {
+        drop_pending_events(ctx, fd);
         if (epoll_ctl(epfd, EPOLL_CTL_DEL, fd, nullptr) != 0) {
             errno = EINVAL;
             return -1;
         }
-        return 0;
     }
-    clear_everywhere(ctx, fd);
-    if (ctx->nfds == fd + 1)
-        lower_nfds(ctx, fd);
     return 0;
 }
 
@@ -164,7 +187,8 @@ void *SelGetFDArg(int fd) {
         errno = EINVAL;
         return nullptr;
     }
-    SelFdEntry *entry = SelFdSlot(ctx, fd);
+    // Beyond the table: a slot never used.
+    const SelFdEntry *entry = SelFdFind(ctx, fd);
     return entry == nullptr ? nullptr : entry->arg;
 }
 

@@ -18,7 +18,10 @@
 extern "C" {
 #endif
 
-/* One per selector thread. The field order is fixed: tools read it. */
+struct epoll_event;
+
+/* One per selector thread. The field order is fixed: tools read it; fields
+ * are only ever added at the end. */
 typedef struct SelContext {
     sigset_t signals;   /* registered signals: blocked except while waiting */
     fd_set readSet;     /* select-mode interest sets */
@@ -35,6 +38,12 @@ typedef struct SelContext {
     fd_set readyRead;   /* working sets of the current wait */
     fd_set readyWrite;
     fd_set readyExcept;
+    uint32_t passCount; /* passes started in this thread, nested ones included */
+    /* The events of the running epoll pass, and the first not yet
+     * dispatched: SelRemFD drops a removed descriptor's events from it. */
+    struct epoll_event *epollBatch;
+    int32_t epollBatchNext;
+    int32_t epollBatchEnd;
 } SelContext;
 
 /* Internal operations, hidden from the library's users but linkable by the
@@ -53,6 +62,10 @@ QORBU_HIDDEN void SelHeapDown(SelContext *ctx, uint32_t slot);
 QORBU_HIDDEN int SelRunTimers(SelContext *ctx);
 
 QORBU_HIDDEN SelFdEntry *SelFdSlot(SelContext *ctx, int fd);
+/* The entry of fd when the table reaches it, else null; never grows it. */
+static inline SelFdEntry *SelFdFind(SelContext *ctx, int fd) {
+    return fd >= 0 && fd < ctx->fdTableSize ? &ctx->fdTable[fd] : (SelFdEntry *)0;
+}
 QORBU_HIDDEN void SelDispatchFD(SelContext *ctx, int fd, unsigned int event);
 
 QORBU_HIDDEN int SelReapIdleFDs(SelTimer *timer);
@@ -77,9 +90,27 @@ inline constexpr int kErestart = 85;
 QORBU_HIDDEN extern std::atomic<int> epoll_fd;
 inline int current_epoll_fd() { return epoll_fd.load(std::memory_order_relaxed); }
 
-/* The reaper timer is armed in one live thread's heap at a time. */
+/* The reaper timer is armed in one live thread's heap at a time: the
+ * owner's. When the owner's thread ends, the next pass of any selector
+ * thread takes the reaper over; a pass pays one relaxed load for this. */
+QORBU_HIDDEN extern std::atomic<SelContext *> reaper_owner;
 QORBU_HIDDEN void arm_reaper_if_free(SelContext *ctx);
 QORBU_HIDDEN void release_reaper(SelContext *ctx);
+inline void adopt_orphaned_reaper(SelContext *ctx) {
+    if (reaper_owner.load(std::memory_order_relaxed) == nullptr) arm_reaper_if_free(ctx);
+}
+
+/* Starts a pass: counts it (a dispatch loop stops once a callback has run a
+ * nested pass) and takes an orphaned reaper over. Returns the pass number. */
+inline uint32_t begin_pass(SelContext *ctx) {
+    adopt_orphaned_reaper(ctx);
+    return ++ctx->passCount;
+}
+
+/* One SelEpoll pass. The run loop of the green threads passes true: with no
+ * timer armed it sleeps until a descriptor or a signal wakes it, where
+ * SelEpoll itself does not wait at all. */
+QORBU_HIDDEN int epoll_pass(bool sleepWithoutTimer);
 
 } // namespace qorbu::sel
 #endif

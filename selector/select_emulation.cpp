@@ -2,6 +2,7 @@
  * selector, so that the thread's other descriptors and timers keep being
  * served while the caller waits. */
 #include <cerrno>
+#include <climits>
 #include <cstring>
 
 #include "selector/dispatch_private.h"
@@ -42,7 +43,7 @@ unsigned int requested_events(const SelectWait &wait, int fd) {
 /* A descriptor that is already registered in this thread belongs to its
  * owner: it is neither re-registered nor removed afterwards. */
 bool registered_by_owner(int fd) {
-    SelFdEntry *entry = SelFdSlot(SelCurrentContext(), fd);
+    const SelFdEntry *entry = SelFdFind(SelCurrentContext(), fd);
     return entry && entry->events != 0;
 }
 
@@ -70,13 +71,34 @@ void remove_ours(int nfds, const fd_set *ours) {
         if (FD_ISSET(fd, ours)) SelRemFD(fd);
 }
 
+/* select() carries whole seconds out of tv_usec (and borrows them for a
+ * negative one); so does the wait here, in 64-bit arithmetic that saturates
+ * where the sum would overflow. */
+void split_timeout(const struct timeval &tv, long *sec, long *nsec) {
+    constexpr long long kUsecPerSec = 1000000;
+    long long usec = tv.tv_usec;
+    long long carry = usec / kUsecPerSec;
+    usec %= kUsecPerSec;
+    if (usec < 0) {
+        usec += kUsecPerSec;
+        --carry;
+    }
+    long long seconds;
+    if (__builtin_add_overflow(static_cast<long long>(tv.tv_sec), carry, &seconds))
+        seconds = carry > 0 ? LLONG_MAX : LLONG_MIN;
+    *sec = seconds > LONG_MAX ? LONG_MAX : seconds < LONG_MIN ? LONG_MIN : static_cast<long>(seconds);
+    *nsec = static_cast<long>(usec * qorbu::sel::kNsecPerUsec);
+}
+
 /* Arms the time-out timer unless the deadline came out negative. */
 bool arm_timeout(SelTimer *timer, const struct timeval *timeout, SelectWait *wait) {
     if (!timeout) return false;
     memset(timer, 0, sizeof *timer);
     timer->callback = select_on_timeout;
     timer->arg = wait;
-    SelMakeWhen(&timer->when, timeout->tv_sec, static_cast<long>(timeout->tv_usec) * qorbu::sel::kNsecPerUsec);
+    long sec, nsec;
+    split_timeout(*timeout, &sec, &nsec);
+    SelMakeWhen(&timer->when, sec, nsec);
     if (timer->when.tv_sec < 0) return false;
     SelAddTimer(timer);
     return true;
@@ -84,6 +106,25 @@ bool arm_timeout(SelTimer *timer, const struct timeval *timeout, SelectWait *wai
 
 void clear_if_present(fd_set *set) {
     if (set) FD_ZERO(set);
+}
+
+fd_set *copy_if_present(const fd_set *set, fd_set *copy) {
+    if (!set) return nullptr;
+    *copy = *set;
+    return copy;
+}
+
+/* select() refuses a set that holds a descriptor which is not open, and so
+ * does this call, before anything is registered: the pass would take it for
+ * a registration whose owner closed it and end the process. One probe that
+ * does not wait checks them all. */
+bool holds_closed_descriptor(int nfds, const SelectWait &wait) {
+    if (nfds == 0 || (!wait.readfds && !wait.writefds && !wait.exceptfds)) return false;
+    fd_set r, w, e;
+    struct timeval zero = {0, 0};
+    return select(nfds, copy_if_present(wait.readfds, &r), copy_if_present(wait.writefds, &w),
+                  copy_if_present(wait.exceptfds, &e), &zero) < 0 &&
+           errno == EBADF;
 }
 
 } // namespace
@@ -94,8 +135,9 @@ extern "C" QORBU_API int zarn_select(int nfds, fd_set *readfds, fd_set *writefds
         errno = EINVAL;
         return -1;
     }
-    errno = 0;
     SelectWait wait = {readfds, writefds, exceptfds, 0};
+    if (holds_closed_descriptor(nfds, wait)) return -1; /* errno EBADF */
+    errno = 0;
     fd_set ours;
     register_requested(nfds, &wait, &ours);
     SelTimer timer;

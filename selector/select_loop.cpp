@@ -37,6 +37,7 @@ struct Pass {
     int waitResult;
     int ready; /* reported (descriptor, kind) pairs not dispatched yet */
     bool scanDispatched;
+    uint32_t number; /* the context's passCount when this pass began */
 };
 
 constexpr const char *kWaitFailed = "SelSelect(): [p]select() failed";
@@ -54,7 +55,10 @@ void copy_interest_sets(Pass &p) {
     p.width = ctx->nfds;
 }
 
+/* The wait never reaches past the working sets, whatever count the host or
+ * Net-SNMP report: descriptors of theirs at 1024 or above are not waited on. */
 void raise_width(Pass &p, int width) {
+    width = clamp_to_set_size(width);
     if (width > p.width) p.width = width;
 }
 
@@ -63,7 +67,7 @@ void raise_width(Pass &p, int width) {
 void merge_host_sets(Pass &p) {
     const SelHostScheduler *host = p.host;
     SelContext *ctx = p.ctx;
-    const int limit = clamp_to_set_size(host->max_fd + 1);
+    const int limit = host->max_fd >= kSelectSetSize ? kSelectSetSize : clamp_to_set_size(host->max_fd + 1);
     for (int i = 0; i * kFdWordBits < limit; ++i) {
         const FdWord mask = fd_word_mask_below(i, limit);
         const FdWord r = fd_word(&host->readfd, i) & mask;
@@ -294,35 +298,40 @@ bool any_exceptional_reported(const SelContext *ctx) {
     return false;
 }
 
-/* True when the ready count is spent. */
+/* Runs one callback. True when this pass has nothing more to dispatch:
+ * the ready count is spent, or the callback ran a nested pass, which reused
+ * the working sets and served what this pass had left. */
+bool dispatch_one(Pass &p, int fd, unsigned int event) {
+    SelDispatchFD(p.ctx, fd, event);
+    if (p.ctx->passCount != p.number) {
+        p.ready = 0;
+        return true;
+    }
+    return --p.ready == 0;
+}
+
 bool dispatch_exceptional(Pass &p, int limit) {
     SelContext *ctx = p.ctx;
-    for (int fd = next_exceptional(ctx, 0, limit); fd >= 0; fd = next_exceptional(ctx, fd + 1, limit)) {
-        SelDispatchFD(ctx, fd, SEL_EXCEPT);
-        if (--p.ready == 0) return true;
-    }
+    for (int fd = next_exceptional(ctx, 0, limit); fd >= 0; fd = next_exceptional(ctx, fd + 1, limit))
+        if (dispatch_one(p, fd, SEL_EXCEPT)) return true;
     return false;
 }
 
-bool count_read_write_dispatch(Pass &p, int fd) {
-    if (!p.scanDispatched) {
-        p.scanDispatched = true;
-        p.ctx->scanStart = fd + 1;
-    }
-    return --p.ready == 0;
+bool dispatch_read_write(Pass &p, int fd, unsigned int event) {
+    const bool first = !p.scanDispatched;
+    p.scanDispatched = true;
+    const bool done = dispatch_one(p, fd, event);
+    if (first) p.ctx->scanStart = fd + 1;
+    return done;
 }
 
 bool dispatch_read_write_range(Pass &p, int from, int to) {
     SelContext *ctx = p.ctx;
     for (int fd = next_read_write(ctx, from, to); fd >= 0; fd = next_read_write(ctx, fd + 1, to)) {
-        if (FD_ISSET(fd, &ctx->readyRead) && FD_ISSET(fd, &ctx->readSet)) {
-            SelDispatchFD(ctx, fd, SEL_READ);
-            if (count_read_write_dispatch(p, fd)) return true;
-        }
-        if (FD_ISSET(fd, &ctx->readyWrite) && FD_ISSET(fd, &ctx->writeSet)) {
-            SelDispatchFD(ctx, fd, SEL_WRITE);
-            if (count_read_write_dispatch(p, fd)) return true;
-        }
+        if (FD_ISSET(fd, &ctx->readyRead) && FD_ISSET(fd, &ctx->readSet) && dispatch_read_write(p, fd, SEL_READ))
+            return true;
+        if (FD_ISSET(fd, &ctx->readyWrite) && FD_ISSET(fd, &ctx->writeSet) && dispatch_read_write(p, fd, SEL_WRITE))
+            return true;
     }
     return false;
 }
@@ -406,6 +415,7 @@ using namespace qorbu::sel;
 extern "C" QORBU_API int SelSelect(void) {
     Pass p{};
     p.ctx = SelCurrentContext();
+    p.number = begin_pass(p.ctx);
     p.host = host_scheduler_of(p.ctx->zg);
     p.chosen = TimeoutSource::None;
 

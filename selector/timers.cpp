@@ -8,6 +8,8 @@
 #include <stdlib.h>
 #include <unistd.h>
 
+#include <limits>
+
 #include "selector/sel_private.h"
 
 using namespace qorbu::sel;
@@ -166,13 +168,30 @@ int SelGetTime(struct timespec *now) {
 
 int SelMakeWhen(struct timespec *when, long sec, long nsec) {
     SelGetTime(when);
-    when->tv_sec += sec;
-    if (nsec == 0)
-        return 0;
-    when->tv_nsec += nsec;
-    if (when->tv_nsec > kNsecPerSec - 1) {
-        when->tv_sec += 1;
-        when->tv_nsec -= kNsecPerSec;
+    // Whole seconds in nsec are carried (a negative rest borrows one), and a
+    // deadline beyond what time_t holds saturates instead of wrapping.
+    long long carry = nsec / kNsecPerSec;
+    long long rest = static_cast<long long>(when->tv_nsec) + nsec % kNsecPerSec;
+    if (rest > kNsecPerSec - 1) {
+        rest -= kNsecPerSec;
+        ++carry;
+    } else if (rest < 0) {
+        rest += kNsecPerSec;
+        --carry;
+    }
+    long long seconds;
+    const bool overflow = __builtin_add_overflow(static_cast<long long>(when->tv_sec), static_cast<long long>(sec),
+                                                 &seconds) ||
+                          __builtin_add_overflow(seconds, carry, &seconds);
+    constexpr time_t kLatest = std::numeric_limits<time_t>::max();
+    constexpr time_t kEarliest = std::numeric_limits<time_t>::min();
+    if (overflow ? sec > 0 : seconds > kLatest) {
+        *when = {kLatest, kNsecPerSec - 1};
+    } else if (overflow || seconds < kEarliest) {
+        *when = {kEarliest, 0};
+    } else {
+        when->tv_sec = static_cast<time_t>(seconds);
+        when->tv_nsec = static_cast<long>(rest);
     }
     return 0;
 }

@@ -50,6 +50,38 @@ int remove_the_other(int fd, unsigned event, void *arg, SelFdEntry *entry) {
     return 0;
 }
 
+/* The first of two ready descriptors to run closes the other and registers
+ * a fresh, idle pipe under its number. */
+struct Replacement {
+    int *other;
+    Pipe *fresh;
+};
+bool replaced = false;
+int replace_the_other(int fd, unsigned event, void *arg, SelFdEntry *entry) {
+    log_callback(fd, event, arg, entry);
+    if (replaced) return 0;
+    replaced = true;
+    auto *r = static_cast<Replacement *>(arg);
+    EXPECT_EQ(SelRemFD(*r->other), 0);
+    EXPECT_EQ(dup2(r->fresh->r, *r->other), *r->other);
+    EXPECT_EQ(SelAddFD(*r->other, SEL_READ, 0, log_callback, nullptr), 0);
+    return 0;
+}
+
+/* Consumes its byte, then (outside a nested pass) runs one nested pass. */
+int nesting = 0;
+int consume_then_nest(int fd, unsigned event, void *arg, SelFdEntry *entry) {
+    log_callback(fd, event, arg, entry);
+    char byte;
+    EXPECT_EQ(read(fd, &byte, 1), 1) << "dispatched for readiness that is gone";
+    if (nesting == 0) {
+        ++nesting;
+        EXPECT_EQ(SelEpoll(), 0);
+        --nesting;
+    }
+    return 0;
+}
+
 } // namespace
 
 TEST_F(EpollInstance, OneCloseOnExecInstanceUntilDeInitNeverStoredAsDescriptorZero) {
@@ -147,6 +179,53 @@ TEST_F(Epoll, EventsOfUnregisteredOrRemovedDescriptorsAreSkipped) {
     ASSERT_EQ(watch(b.r, SEL_READ, remove_the_other, &a.r), 0);
     EXPECT_EQ(SelEpoll(), 0);
     EXPECT_EQ(callbacks_logged().size(), 1u) << "removed earlier in the batch";
+}
+
+TEST_F(Epoll, EventsOfARemovedDescriptorOrServedByANestedPassAreDropped) {
+    Pipe a, b, freshA, freshB;
+    a.fill();
+    b.fill();
+    Replacement forA{&b.r, &freshB}, forB{&a.r, &freshA};
+    ASSERT_EQ(watch(a.r, SEL_READ, replace_the_other, &forA), 0);
+    ASSERT_EQ(watch(b.r, SEL_READ, replace_the_other, &forB), 0);
+    EXPECT_EQ(SelEpoll(), 0);
+    EXPECT_EQ(callbacks_logged().size(), 1u) << "the stale event reached the new registration";
+    SelRemFD(a.r);
+    SelRemFD(b.r);
+
+    Pipe c, d;
+    for (Pipe *p : {&c, &d}) {
+        fcntl(p->r, F_SETFL, O_NONBLOCK);
+        p->fill();
+        ASSERT_EQ(watch(p->r, SEL_READ, consume_then_nest), 0);
+    }
+    arm_guard_timer(0); /* ends a nested pass that finds nothing */
+    clear_log();
+    EXPECT_EQ(SelEpoll(), 0);
+    EXPECT_EQ(callbacks_logged().size(), 2u) << "each readable once";
+}
+
+TEST_F(Epoll, NumbersThatCannotBeOpenDescriptorsGrowNothing) {
+    Pipe p;
+    ASSERT_EQ(watch(p.r), 0);
+    const int tableSize = ctx->fdTableSize;
+    errno = 0;
+    EXPECT_EQ(watch(20000000), -1);
+    EXPECT_EQ(errno, EBUSY);
+    EXPECT_EQ(SelGetFDArg(20000000), nullptr);
+    EXPECT_EQ(SelRemFD(20000000), -1);
+    EXPECT_EQ(errno, EINVAL);
+    /* An event of a descriptor that no thread registered, far up the table. */
+    Pipe foreign;
+    foreign.fill();
+    ASSERT_EQ(dup2(foreign.r, 1000), 1000);
+    struct epoll_event ev {};
+    ev.events = EPOLLIN;
+    ev.data.fd = 1000;
+    ASSERT_EQ(epoll_ctl(GetEpollFd(), EPOLL_CTL_ADD, 1000, &ev), 0);
+    EXPECT_EQ(SelEpoll(), 0);
+    EXPECT_EQ(ctx->fdTableSize, tableSize);
+    close(1000);
 }
 
 TEST_F(Epoll, NoTimerMeansNoWaitAndADueTimerEndsThePassBeforeTheWaitAndItsSignals) {

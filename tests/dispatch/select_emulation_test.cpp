@@ -1,5 +1,6 @@
 /* zarn_select: select()'s results from one pass of the thread's selector. */
 #include <cerrno>
+#include <climits>
 #include <initializer_list>
 
 #include "dispatch_fixture.h"
@@ -92,6 +93,52 @@ TEST_F(ZarnSelect, TimeoutsAreKeptAndAnotherTimerOfTheThreadEndsTheCallEarly) {
     EXPECT_LT(seconds_since(start), 15.0);
     EXPECT_EQ(scripted::times("timer:guard"), 1);
     EXPECT_EQ(ctx->timerCount, timersBefore) << "the guard fired and the call's own timer is disarmed";
+}
+
+/* As select() does, whole seconds in tv_usec are carried (or borrowed) and
+ * the call waits the whole time-out; a far-off one waits for the thread's
+ * next timer, without overflow. */
+TEST_F(ZarnSelect, MicrosecondsCarryIntoSecondsAndFarTimeoutsSaturate) {
+    const struct {
+        struct timeval timeout;
+        double atLeast;
+    } waits[] = {{{0, 1200000}, 1.15}, {{2, -1500000}, 0.45}};
+    for (const auto &w : waits) {
+        struct timeval timeout = w.timeout;
+        const auto start = Clock::now();
+        EXPECT_EQ(zarn_select(0, nullptr, nullptr, nullptr, &timeout), 0) << w.timeout.tv_usec;
+        EXPECT_GE(seconds_since(start), w.atLeast) << w.timeout.tv_usec;
+        EXPECT_LT(seconds_since(start), w.atLeast + 10.0);
+        expect_registry_clean();
+    }
+    for (struct timeval far : {timeval{LONG_MAX, 0}, timeval{LONG_MAX, 2500000}, timeval{LONG_MAX - 1, 999999}}) {
+        arm_guard_timer(50);
+        const long guardsBefore = scripted::times("timer:guard");
+        EXPECT_EQ(zarn_select(0, nullptr, nullptr, nullptr, &far), 0) << far.tv_sec;
+        EXPECT_EQ(scripted::times("timer:guard"), guardsBefore + 1) << far.tv_sec;
+        expect_registry_clean();
+    }
+}
+
+/* A set holding a descriptor that is not open: -1/EBADF like select(),
+ * with nothing registered, armed or cleared, and the process goes on. */
+TEST_F(ZarnSelect, ClosedDescriptorIsRefusedWithEbadf) {
+    Pipe ready(40), closed(41);
+    ready.fill();
+    close(closed.r);
+    closed.r = -1;
+    struct timeval timeout = {20, 0};
+    for (bool inExceptSet : {false, true}) {
+        fd_set r = set_of({40}), e = set_of({});
+        FD_SET(41, inExceptSet ? &e : &r);
+        errno = 0;
+        EXPECT_EQ(zarn_select(42, &r, nullptr, &e, &timeout), -1);
+        EXPECT_EQ(errno, EBADF);
+        EXPECT_TRUE(FD_ISSET(40, &r)) << "the sets are left as they were";
+        expect_registry_clean();
+    }
+    fd_set r = set_of({40});
+    EXPECT_EQ(zarn_select(41, &r, nullptr, nullptr, &timeout), 1);
 }
 
 TEST_F(ZarnSelect, OwnersRegistrationIsServedAndKept) {

@@ -3,7 +3,10 @@
 #include <arpa/inet.h>
 #include <netinet/in.h>
 
+#include <sys/resource.h>
+
 #include <cerrno>
+#include <climits>
 #include <cstdio>
 #include <thread>
 
@@ -39,6 +42,26 @@ int reregister_for_except(int fd, unsigned event, void *arg, SelFdEntry *entry) 
     log_callback(fd, event, arg, entry);
     EXPECT_EQ(SelRemFD(fd), 0);
     EXPECT_EQ(SelAddFD(fd, SEL_EXCEPT, 0, log_callback, nullptr), 0);
+    return 0;
+}
+
+/* Consumes the byte that made a non-blocking pipe readable. */
+int consume_byte(int fd, unsigned event, void *arg, SelFdEntry *entry) {
+    log_callback(fd, event, arg, entry);
+    char byte;
+    EXPECT_EQ(read(fd, &byte, 1), 1) << "dispatched for readiness that is gone";
+    return 0;
+}
+
+/* Runs the nested pass that arg names: SelSelect, or zarn_select on 42. */
+int run_nested_pass(int fd, unsigned event, void *arg, SelFdEntry *entry) {
+    consume_byte(fd, event, nullptr, entry);
+    if (arg == nullptr) return SelSelect();
+    fd_set r;
+    FD_ZERO(&r);
+    FD_SET(42, &r);
+    struct timeval timeout = {10, 0};
+    EXPECT_EQ(zarn_select(43, &r, nullptr, nullptr, &timeout), 1);
     return 0;
 }
 
@@ -316,6 +339,27 @@ TEST_F(SelectDispatch, CallbacksRemovingOrReRegisteringDescriptorsMidPass) {
     EXPECT_FALSE(FD_ISSET(s.sv[0], &ctx->writeSet));
 }
 
+/* A host replacing select() runs passes inside callbacks: what the nested
+ * pass served is not dispatched again by the outer one. */
+TEST_F(SelectDispatch, NestedPassInACallbackLeavesNothingStaleToTheOuterPass) {
+    for (bool viaZarnSelect : {false, true}) {
+        SCOPED_TRACE(viaZarnSelect ? "zarn_select" : "SelSelect");
+        Pipe outer(40), served(41), asked(42);
+        for (Pipe *p : {&outer, &served, &asked}) {
+            fcntl(p->r, F_SETFL, O_NONBLOCK);
+            p->fill();
+        }
+        ASSERT_EQ(watch(40, SEL_READ, run_nested_pass, viaZarnSelect ? &asked : nullptr), 0);
+        ASSERT_EQ(watch(41, SEL_READ, consume_byte), 0);
+        ctx->scanStart = 0;
+        clear_log();
+        EXPECT_EQ(SelSelect(), 0);
+        EXPECT_EQ(callbacks_logged(), (Log{cb(40, "r"), cb(41, "r")}));
+        ASSERT_EQ(SelRemFD(40), 0);
+        ASSERT_EQ(SelRemFD(41), 0);
+    }
+}
+
 /* --- wait failures --------------------------------------------------------- */
 
 TEST_F(SelectFailures, ClosedDescriptorIsNamedWithItsCallbackThenAborts) {
@@ -335,6 +379,48 @@ TEST_F(SelectFailures, ClosedDescriptorIsNamedWithItsCallbackThenAborts) {
                                             callback +
                                             ") is invalid (probably close()ed)\n"
                                             "SelSelect(): fd 50 (callback (nil)) is invalid (probably close()ed)\n"));
+}
+
+/* The wait never reaches past the 1024-bit working sets, whatever count the
+ * host or Net-SNMP report (Net-SNMP counts sockets it cannot put in a set).
+ * An invalid time-out makes each wait fail before it looks at the sets, and
+ * the diagnostic shows the width it was given. */
+TEST_F(SelectFailures, WaitWidthNeverExceedsTheSets) {
+    give_snmp_timeout(0, 1500000);
+    use_host();
+    Pipe idle(40), hostPipe(60);
+    ASSERT_EQ(watch(idle.r), 0);
+    const struct {
+        int snmpCount, maxFd, width;
+    } cases[] = {{2000, -1, 1024}, {FD_SETSIZE + 1, -1, 1024}, {0, INT_MAX, 61}, {0, 5000, 61}, {5000, INT_MAX, 1024}};
+    for (const auto &c : cases) {
+        host().snmpCount = c.snmpCount;
+        host().scheduler.max_fd = c.maxFd;
+        FD_ZERO(&host().scheduler.readfd);
+        if (c.maxFd >= 0) FD_SET(60, &host().scheduler.readfd);
+        sel_einval_count.store(0);
+        testing::internal::CaptureStderr();
+        EXPECT_EQ(SelSelect(), -1);
+        const std::string err = testing::internal::GetCapturedStderr();
+        EXPECT_NE(err.find("invalid params in select " + std::to_string(c.width) + " "), std::string::npos)
+            << c.snmpCount << " " << c.maxFd << ": " << err.substr(0, 160);
+    }
+
+    /* A real wait with descriptors open up to 1999 (where the limit allows):
+     * served as usual, nothing past the sets read or written. */
+    struct rlimit limit;
+    ASSERT_EQ(getrlimit(RLIMIT_NOFILE, &limit), 0);
+    limit.rlim_cur = std::max<rlim_t>(limit.rlim_cur, 2048);
+    if (limit.rlim_cur > limit.rlim_max || setrlimit(RLIMIT_NOFILE, &limit) != 0) return;
+    ASSERT_EQ(dup2(idle.w, 1999), 1999);
+    host().giveSnmpTimeout = false;
+    host().snmpCount = 2000;
+    host().scheduler.max_fd = INT_MAX;
+    idle.fill();
+    clear_log();
+    EXPECT_EQ(SelSelect(), 0);
+    EXPECT_EQ(callbacks_logged(), (Log{cb(40, "r")}));
+    close(1999);
 }
 
 TEST_F(SelectFailures, EinvalCountIsSharedByThreadsAndTheFifthFailureAborts) {

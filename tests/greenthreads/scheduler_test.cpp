@@ -1,5 +1,8 @@
 // The run queue, yield/block/wakeup, record reuse and the run loop. Every
 // test case runs in a fresh process, so each starts with a fresh scheduler.
+#include <chrono>
+#include <thread>
+
 #include "gt_test_support.h"
 
 using namespace qorbu::gt;
@@ -152,6 +155,26 @@ TEST_F(Scheduler, WakeupQueuesOnlyABlockedThreadAndOnlyOnce)
     greenthread_wakeup(sleeper);
     greenthreads_run();
     EXPECT_EQ(wakeups, 2);
+
+    // A finished record waits on the free list: waking it, from the main
+    // context or from a green thread, queues nothing.
+    ASSERT_EQ(free_threads, sleeper);
+    greenthread_wakeup(sleeper);
+    ASSERT_EQ(queue_length(), 0);
+    static Greenthread *quick;
+    static int queuedAfterWake;
+    quick = greenthread_create(do_nothing, nullptr);
+    greenthread_create(
+        [](void *) {
+            greenthread_yield(); // quick finishes meanwhile
+            ASSERT_EQ(free_threads, quick);
+            greenthread_wakeup(quick);
+            queuedAfterWake = queue_length();
+        },
+        nullptr);
+    greenthreads_run();
+    EXPECT_EQ(queuedAfterWake, 1) << "only the main context";
+    EXPECT_EQ(live_threads, 0);
 }
 
 int count_pass(int, unsigned, void *arg, SelFdEntry *)
@@ -227,8 +250,40 @@ TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds)
         EXPECT_EQ(trace, "YYYT");
         EXPECT_EQ(live_threads, 0);
         EXPECT_EQ(wake.timer.heapIndex, 0u);
-        EXPECT_EQ(wake.thread->runnable, 0);
+        EXPECT_EQ(wake.thread->runnable, kFinished);
         EXPECT_EQ(free_threads, wake.thread) << "the timer's thread finished last";
+    }
+    DeInitEpoll();
+}
+
+/* Every green thread waits on a descriptor and no timer is armed: the run
+ * loop sleeps in the kernel until the descriptor wakes it, in either mode. */
+TEST_F(Scheduler, AllWaitingWithoutATimerSleepsInTheKernel)
+{
+    for (const bool epoll : {false, true}) {
+        SCOPED_TRACE(epoll ? "epoll mode" : "select mode");
+        if (epoll) {
+            ASSERT_EQ(SelUseEpoll(), 0);
+        }
+        SelRemoveAllTimers(); // the reaper's, when this thread owns it
+        static qorbu::test::SocketPair pair;
+        static char byte;
+        greenthread_create([](void *) { EXPECT_EQ(nb_read(pair.fd[0], &byte, 1), 1); }, nullptr);
+        std::thread writer([] {
+            std::this_thread::sleep_for(std::chrono::milliseconds(1000));
+            EXPECT_EQ(write(pair.fd[1], "x", 1), 1);
+        });
+        timespec cpuBefore, cpuAfter;
+        clock_gettime(CLOCK_THREAD_CPUTIME_ID, &cpuBefore);
+        const double start = qorbu::test::seconds_now();
+        greenthreads_run();
+        const double waited = qorbu::test::seconds_now() - start;
+        clock_gettime(CLOCK_THREAD_CPUTIME_ID, &cpuAfter);
+        writer.join();
+        const double cpu = static_cast<double>(cpuAfter.tv_sec - cpuBefore.tv_sec) +
+                           static_cast<double>(cpuAfter.tv_nsec - cpuBefore.tv_nsec) / 1e9;
+        EXPECT_GE(waited, 0.9);
+        EXPECT_LT(cpu, 0.4 * waited) << "the run loop spun for " << cpu << " s of " << waited << " s";
     }
     DeInitEpoll();
 }

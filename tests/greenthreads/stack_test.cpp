@@ -78,6 +78,64 @@ TEST_F(Stack, TouchingTheGuardPageOrOverflowingEndsWithSigsegv)
     });
 }
 
+/* A frame larger than a page, entered with less than a page of stack left:
+ * built with stack clash protection, its first probe faults on the
+ * thread's own guard page instead of landing in the neighbouring stack. */
+constexpr size_t kLargeFrame = 3 * 4096;
+char *guardLow;
+
+__attribute__((noinline)) int large_frame()
+{
+    volatile char frame[kLargeFrame];
+    frame[0] = 1; // the lowest byte: three pages below the caller
+    frame[kLargeFrame - 1] = 1;
+    return frame[0] + frame[kLargeFrame - 1];
+}
+
+__attribute__((noinline)) void descend_then_call_large_frame()
+{
+    volatile char pad[64];
+    pad[0] = 0;
+    if (static_cast<char *>(__builtin_frame_address(0)) - (guardLow + page_size) > 1024)
+        descend_then_call_large_frame();
+    else
+        pad[0] = static_cast<char>(large_frame());
+    pad[0] = pad[0] + 1; // keeps the call from becoming a jump
+}
+
+void on_segv(int, siginfo_t *info, void *)
+{
+    const char *fault = static_cast<const char *>(info->si_addr);
+    if (fault < guardLow || fault >= guardLow + page_size)
+        _exit(3); // not the overflowing thread's guard page
+    signal(SIGSEGV, SIG_DFL); // the access faults again and ends the process
+}
+
+TEST_F(Stack, LargeFrameOverflowFaultsOnTheThreadsOwnGuardPage)
+{
+    if (page_size > 4096)
+        GTEST_SKIP() << "the frame is sized for 4 KiB pages";
+    EXPECT_EXIT(
+        {
+            static char altStack[64 * 1024];
+            stack_t alt{};
+            alt.ss_sp = altStack;
+            alt.ss_size = sizeof altStack;
+            sigaltstack(&alt, nullptr);
+            struct sigaction sa {};
+            sa.sa_sigaction = on_segv;
+            sa.sa_flags = SA_SIGINFO | SA_ONSTACK;
+            sigaction(SIGSEGV, &sa, nullptr);
+            Greenthread *overflowing = greenthread_create(
+                [](void *) { descend_then_call_large_frame(); }, nullptr);
+            greenthread_create([](void *) {}, nullptr); // the neighbouring stack
+            guardLow = static_cast<char *>(overflowing->context.uc_stack.ss_sp);
+            greenthreads_run();
+            _exit(0);
+        },
+        ::testing::KilledBySignal(SIGSEGV), "");
+}
+
 #if defined(__SANITIZE_ADDRESS__)
 __attribute__((noinline)) void overflow_a_local(void *)
 {

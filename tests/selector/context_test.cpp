@@ -3,6 +3,10 @@
 #include <signal.h>
 #include <stddef.h>
 
+#include <atomic>
+#include <thread>
+#include <vector>
+
 #include "selector_fixture.h"
 
 using qorbu::test::SelectorTest;
@@ -22,7 +26,9 @@ static_assert(offsetof(SelContext, fdTable) == 520 && offsetof(SelContext, fdTab
 static_assert(offsetof(SelContext, timerHeap) == 528 && offsetof(SelContext, timerCount) == 532);
 static_assert(offsetof(SelContext, timerCapacity) == 536 && offsetof(SelContext, zg) == 540);
 static_assert(offsetof(SelContext, readyRead) == 544 && offsetof(SelContext, readyWrite) == 672);
-static_assert(offsetof(SelContext, readyExcept) == 800 && sizeof(SelContext) == 928);
+static_assert(offsetof(SelContext, readyExcept) == 800);
+// Later fields are appended behind the ones above, which keep their places.
+static_assert(offsetof(SelContext, passCount) == 928);
 #endif
 static_assert(SEL_READ == 1u && SEL_WRITE == 2u && SEL_EXCEPT == 4u && SEL_IN_CALLBACK == 8u);
 
@@ -175,6 +181,52 @@ TEST(SelContextThreads, ReaperPassesOnWhenItsThreadEnds) {
     ASSERT_EQ(SelInit(), 0);
     EXPECT_EQ(SelCurrentContext()->timerHeap[1], &fd_timer);
     EXPECT_EQ(fd_timer.heapIndex, 1u);
+}
+
+// The reaper's owner ended after other selector threads had started: the
+// next pass of one of them (select or epoll) takes the reaper over, and only
+// one of them does.
+TEST(SelContextThreads, ReaperPassesToAnEarlierThreadAtItsNextPass) {
+    for (int (*pass)() : {SelSelect, SelEpoll}) {
+        SCOPED_TRACE(pass == SelSelect ? "select" : "epoll");
+        if (pass == SelEpoll) {
+            ASSERT_EQ(SelUseEpoll(), 0);
+        }
+        std::atomic<int> stage{0};
+        auto await = [&stage](int s) {
+            while (stage.load() < s)
+                std::this_thread::yield();
+        };
+        std::thread owner([&] {
+            EXPECT_EQ(SelInit(), 0);
+            EXPECT_EQ(SelDebugIsTimerActive(&fd_timer), 1);
+            stage = 1;
+            await(3);
+        });
+        int holds[2] = {-1, -1};
+        std::vector<std::thread> others;
+        for (int i = 0; i < 2; ++i)
+            others.emplace_back([&, i] {
+                await(1);
+                EXPECT_EQ(SelInit(), 0);
+                EXPECT_EQ(SelDebugIsTimerActive(&fd_timer), 0) << "one owner at a time";
+                stage.fetch_add(1);
+                await(4);
+                SelTimer due{};
+                due.callback = qorbu::test::noop_timer_callback;
+                EXPECT_EQ(SelSleep(&due, 0), 0); // ends the pass at once
+                EXPECT_EQ(pass(), 0);
+                holds[i] = SelDebugIsTimerActive(&fd_timer);
+                stage.fetch_add(1);
+                await(6); // both passes done before either thread ends
+            });
+        owner.join();
+        stage = 4;
+        for (auto &t : others)
+            t.join();
+        EXPECT_EQ(holds[0] + holds[1], 1) << "the reaper was taken over by exactly one thread";
+    }
+    DeInitEpoll();
 }
 
 namespace {

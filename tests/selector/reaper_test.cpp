@@ -101,6 +101,43 @@ TEST_F(ReaperTest, EightHundredClosuresAreSurvived) {
     EXPECT_NE(fd_timer.heapIndex, 0u);
 }
 
+// Descriptors registered in select mode and then removed, or reaped, in
+// epoll mode: no interest bit is left behind, so the reaper never closes the
+// unrelated files that get their numbers next, and a select pass after the
+// switch back finds nothing closed.
+TEST_F(ReaperTest, RemovedOrReapedDescriptorLeavesNoTraceInEitherMode) {
+    std::vector<int> fds = open_null(2);
+    for (int fd : fds)
+        ASSERT_EQ(SelAddFD(fd, SEL_READ, 1, noop_fd_callback, nullptr), 0);
+    ASSERT_EQ(SelUseEpoll(), 0);
+    EXPECT_EQ(SelRemFD(fds[0]), -1) << "never added to the epoll instance";
+    close(fds[0]);
+    age(fds[1], 60);
+    run_reaper_now();
+    ASSERT_FALSE(is_open(fds[1])) << "a select-mode registration is reaped in epoll mode too";
+    for (int fd : fds) {
+        EXPECT_FALSE(FD_ISSET(fd, &ctx->readSet)) << fd;
+        // An unrelated file of the host takes the number, looking long idle.
+        const int unrelated = open("/dev/null", O_RDONLY);
+        if (unrelated != fd) {
+            ASSERT_EQ(dup2(unrelated, fd), fd);
+            close(unrelated);
+        }
+        age(fd, 60);
+    }
+    run_reaper_now();
+    for (int fd : fds)
+        EXPECT_TRUE(is_open(fd)) << fd;
+
+    for (int fd : fds)
+        close(fd);
+    DeInitEpoll();
+    SelTimer due{};
+    due.callback = qorbu::test::noop_timer_callback;
+    ASSERT_EQ(SelSleep(&due, 0), 0);
+    EXPECT_EQ(SelSelect(), 0);
+}
+
 using ReaperDeathTest = ReaperTest;
 
 TEST_F(ReaperDeathTest, MoreThanEightHundredClosuresEndTheProcess) {

@@ -29,10 +29,14 @@ TEST_F(SelectorTest, AddRefusesBadArguments) {
     struct Case {
         int fd;
         unsigned events;
-    } cases[] = {{5, SEL_IN_CALLBACK}, {5, SEL_READ | 16u}, {-1, SEL_READ}, {FD_SETSIZE, SEL_READ}, {5000, 0}};
+        SelFdCallback callback;
+    } cases[] = {{5, SEL_IN_CALLBACK, noop_fd_callback}, {5, SEL_READ | 16u, noop_fd_callback},
+                 {-1, SEL_READ, noop_fd_callback},       {FD_SETSIZE, SEL_READ, noop_fd_callback},
+                 {5000, 0, noop_fd_callback},            {5, SEL_READ, nullptr}, // nothing to call
+                 {5, 0, nullptr}};
     for (const Case &c : cases) {
         errno = 0;
-        EXPECT_EQ(SelAddFD(c.fd, c.events, 0, noop_fd_callback, nullptr), -1) << c.fd;
+        EXPECT_EQ(SelAddFD(c.fd, c.events, 0, c.callback, nullptr), -1) << c.fd;
         EXPECT_EQ(errno, EINVAL) << c.fd;
     }
     // Nothing was written past the fd_set or into the table.

@@ -3,6 +3,8 @@
 #include <stdlib.h>
 
 #include <algorithm>
+#include <climits>
+#include <limits>
 #include <map>
 #include <random>
 #include <vector>
@@ -82,6 +84,34 @@ TEST(SelClock, MakeWhenCarriesIntoSeconds) {
     }
     SelMakeWhen(&when, -5, 0);
     EXPECT_TRUE(SelTimerBefore(&when, &base));
+
+    // Nanoseconds outside one second carry or borrow whole seconds; sums
+    // beyond time_t saturate instead of wrapping.
+    constexpr time_t kLatest = std::numeric_limits<time_t>::max();
+    struct Case {
+        long sec, nsec;
+        long long minDelta, maxDelta; // ns after base; 0, 0: saturated
+        struct timespec saturated;
+    } cases[] = {{0, 1999999999L, 1999999999LL, 2999999999LL, {}},
+                 {3, -1, 2999999999LL, 3999999999LL, {}},
+                 {1, -2100000000L, -1100000000LL, -100000000LL, {}},
+                 {LONG_MAX, 999999999L, 0, 0, {kLatest, 999999999L}}};
+    for (const Case &c : cases) {
+        SelGetTime(&base);
+        SelMakeWhen(&when, c.sec, c.nsec);
+        ASSERT_GE(when.tv_nsec, 0) << c.sec << " " << c.nsec;
+        ASSERT_LE(when.tv_nsec, 999999999L) << c.sec << " " << c.nsec;
+        if (c.minDelta == 0 && c.maxDelta == 0) {
+            if (sizeof(long) < sizeof(time_t)) continue; // a long cannot reach the limits
+            EXPECT_EQ(when.tv_sec, c.saturated.tv_sec) << c.sec;
+            EXPECT_EQ(when.tv_nsec, c.saturated.tv_nsec) << c.sec;
+            continue;
+        }
+        long long delta =
+            (static_cast<long long>(when.tv_sec) - base.tv_sec) * 1000000000LL + (when.tv_nsec - base.tv_nsec);
+        EXPECT_GE(delta, c.minDelta) << c.sec << " " << c.nsec;
+        EXPECT_LT(delta, c.maxDelta) << c.sec << " " << c.nsec;
+    }
 }
 
 TEST_F(TimerHeapTest, SleepSetsMillisecondDeadline) {
