@@ -1,8 +1,8 @@
-/* The demo's SNMP agent; see snmp_agent.h. Compiled without
+/* The demo's SNMP agent; see demo.h. Compiled without
  * `net-snmp-config --cflags`, whose large-file flags would change off_t
  * for the rest of the program. */
 #define _GNU_SOURCE
-#include "snmp_agent.h"
+#include "demo.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
@@ -23,39 +23,26 @@ static int started;
 enum Scalar { SCALAR_OPEN_CONNECTIONS = 1, SCALAR_BYTES_ECHOED = 2, SCALAR_SEGMENT_FREE = 3 };
 
 static int answer_scalar(netsnmp_mib_handler *handler, netsnmp_handler_registration *reg,
-                         netsnmp_agent_request_info *reqinfo, netsnmp_request_info *requests)
-{
+                         netsnmp_agent_request_info *reqinfo, netsnmp_request_info *requests) {
     (void)reg;
     if (reqinfo->mode != MODE_GET)
         return SNMP_ERR_NOERROR;
     const enum Scalar object = (enum Scalar)(uintptr_t)handler->myvoid;
     for (netsnmp_request_info *request = requests; request; request = request->next) {
-        switch (object) {
-        case SCALAR_OPEN_CONNECTIONS: {
-            u_long value = source.openConnections(source.arg);
-            snmp_set_var_typed_value(request->requestvb, ASN_GAUGE, &value, sizeof value);
-            break;
-        }
-        case SCALAR_BYTES_ECHOED: {
+        if (object == SCALAR_BYTES_ECHOED) {
             uint64_t total = source.bytesEchoed(source.arg);
             struct counter64 value = {.high = (u_long)(total >> 32), .low = (u_long)(total & 0xffffffffu)};
             snmp_set_var_typed_value(request->requestvb, ASN_COUNTER64, &value, sizeof value);
-            break;
-        }
-        case SCALAR_SEGMENT_FREE: {
-            u_long value = source.segmentFreeBytes(source.arg);
+        } else {
+            u_long value = object == SCALAR_OPEN_CONNECTIONS ? source.openConnections(source.arg)
+                                                             : source.segmentFreeBytes(source.arg);
             snmp_set_var_typed_value(request->requestvb, ASN_GAUGE, &value, sizeof value);
-            break;
-        }
-        default:
-            netsnmp_set_request_error(reqinfo, request, SNMP_NOSUCHOBJECT);
         }
     }
     return SNMP_ERR_NOERROR;
 }
 
-static int register_scalar(const char *name, enum Scalar object)
-{
+static int register_scalar(const char *name, enum Scalar object) {
     /* DEMO_OID_BASE, then the object; the instance .0 is the handler's. */
     oid root[] = {1, 3, 6, 1, 4, 1, 8072, 9999, 9999, 7, (oid)object};
     netsnmp_handler_registration *reg = netsnmp_create_handler_registration(
@@ -66,8 +53,7 @@ static int register_scalar(const char *name, enum Scalar object)
     return netsnmp_register_scalar(reg) == MIB_REGISTERED_OK ? 0 : -1;
 }
 
-static void configure_library(unsigned int port, const char *stateDir)
-{
+static void configure_library(unsigned int port, const char *stateDir) {
     /* No MIB files, configuration files or persistent state from the system. */
     setenv("MIBS", "", 1);
     setenv("MIBDIRS", "", 1);
@@ -88,8 +74,7 @@ static void configure_library(unsigned int port, const char *stateDir)
     netsnmp_ds_set_string(NETSNMP_DS_APPLICATION_ID, NETSNMP_DS_AGENT_PORTS, ports);
 }
 
-int agent_start(const AgentSource *from, unsigned int port, const char *stateDir)
-{
+int agent_start(const AgentSource *from, unsigned int port, const char *stateDir) {
     source = *from;
     /* Warnings and errors on standard error; no line per request. */
     snmp_disable_log();
@@ -121,8 +106,7 @@ int agent_start(const AgentSource *from, unsigned int port, const char *stateDir
     return 0;
 }
 
-void agent_stop(void)
-{
+void agent_stop(void) {
     if (!started)
         return;
     started = 0;
@@ -130,8 +114,7 @@ void agent_stop(void)
     shutdown_agent();
 }
 
-unsigned int agent_pick_free_port(void)
-{
+unsigned int agent_pick_free_port(void) {
     int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
     if (fd < 0)
         return 0;
