@@ -160,19 +160,13 @@ static int parse_options(int argc, char **argv, DemoOptions *options, char *name
 
 /* ---- the segment ---------------------------------------------------------- */
 
-static int segment_exists(const char *name) {
-    char object[256];
-    snprintf(object, sizeof object, "/%s", name);
-    int fd = shm_open(object, O_RDONLY, 0);
-    if (fd < 0)
-        return 0;
-    close(fd);
-    return 1;
-}
-
 static int create_segment(Demo *demo) {
     const DemoOptions *options = &demo->options;
-    if (segment_exists(options->segmentName)) {
+    char object[256];
+    snprintf(object, sizeof object, "/%s", options->segmentName);
+    int fd = shm_open(object, O_RDONLY, 0);
+    if (fd >= 0) {
+        close(fd);
         fprintf(stderr, "qorbu-demo: segment %s already exists (another qorbu-demo? remove it with "
                         "'qorbu-shm unlink %s')\n", options->segmentName, options->segmentName);
         return -1;
@@ -205,11 +199,7 @@ static void remove_segment(Demo *demo) {
     ShmUnlink(demo->options.segmentName);
 }
 
-/* ---- the SNMP agent's view ------------------------------------------------ */
-
-static uint32_t agent_open_connections(void *arg) { return ((Demo *)arg)->summary->openConnections; }
-static uint64_t agent_bytes_echoed(void *arg) { return ((Demo *)arg)->summary->bytesEchoed; }
-static uint32_t agent_segment_free(void *arg) { return ShmTotalFree(((Demo *)arg)->segment); }
+/* ---- the SNMP agent -------------------------------------------------------- */
 
 static int remove_entry(const char *path, const struct stat *st, int flag, struct FTW *ftw) {
     (void)st, (void)flag, (void)ftw;
@@ -228,8 +218,7 @@ static int start_agent(Demo *demo) {
     setenv("SNMPCONFPATH", demo->stateDir, 1);
     setenv("SNMP_PERSISTENT_DIR", demo->stateDir, 1);
     demo->snmpPort = demo->options.snmpPort ? demo->options.snmpPort : agent_pick_free_port();
-    AgentSource source = {agent_open_connections, agent_bytes_echoed, agent_segment_free, demo};
-    return agent_start(&source, demo->snmpPort, demo->stateDir);
+    return agent_start(demo->segment, demo->summary, demo->snmpPort, demo->stateDir);
 }
 
 static void stop_agent(Demo *demo) {

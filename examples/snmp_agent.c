@@ -17,7 +17,8 @@
 #include <net-snmp/agent/net-snmp-agent-includes.h>
 
 static const char kAppName[] = "qorbu-demo";
-static AgentSource source;
+static ShmHandle *segment;
+static const DemoSummary *summary;
 static int started;
 
 enum Scalar { SCALAR_OPEN_CONNECTIONS = 1, SCALAR_BYTES_ECHOED = 2, SCALAR_SEGMENT_FREE = 3 };
@@ -30,12 +31,11 @@ static int answer_scalar(netsnmp_mib_handler *handler, netsnmp_handler_registrat
     const enum Scalar object = (enum Scalar)(uintptr_t)handler->myvoid;
     for (netsnmp_request_info *request = requests; request; request = request->next) {
         if (object == SCALAR_BYTES_ECHOED) {
-            uint64_t total = source.bytesEchoed(source.arg);
+            uint64_t total = summary->bytesEchoed;
             struct counter64 value = {.high = (u_long)(total >> 32), .low = (u_long)(total & 0xffffffffu)};
             snmp_set_var_typed_value(request->requestvb, ASN_COUNTER64, &value, sizeof value);
         } else {
-            u_long value = object == SCALAR_OPEN_CONNECTIONS ? source.openConnections(source.arg)
-                                                             : source.segmentFreeBytes(source.arg);
+            u_long value = object == SCALAR_OPEN_CONNECTIONS ? summary->openConnections : ShmTotalFree(segment);
             snmp_set_var_typed_value(request->requestvb, ASN_GAUGE, &value, sizeof value);
         }
     }
@@ -74,8 +74,9 @@ static void configure_library(unsigned int port, const char *stateDir) {
     netsnmp_ds_set_string(NETSNMP_DS_APPLICATION_ID, NETSNMP_DS_AGENT_PORTS, ports);
 }
 
-int agent_start(const AgentSource *from, unsigned int port, const char *stateDir) {
-    source = *from;
+int agent_start(ShmHandle *theSegment, const DemoSummary *theSummary, unsigned int port, const char *stateDir) {
+    segment = theSegment;
+    summary = theSummary;
     /* Warnings and errors on standard error; no line per request. */
     snmp_disable_log();
     netsnmp_log_handler *log = netsnmp_register_loghandler(NETSNMP_LOGHANDLER_STDERR, LOG_WARNING);
