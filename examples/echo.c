@@ -1,6 +1,6 @@
-/* The echo service; see echo.h. */
+/* The echo service; see demo.h. */
 #define _GNU_SOURCE
-#include "echo.h"
+#include "demo.h"
 
 #include <arpa/inet.h>
 #include <errno.h>
@@ -24,8 +24,7 @@ typedef struct Connection {
     char buffer[kEchoBufferSize];
 } Connection;
 
-static DemoConnection *record_open(EchoService *svc, int fd, unsigned int peerPort)
-{
+static DemoConnection *record_open(EchoService *svc, int fd, unsigned int peerPort) {
     DemoConnection *record = ShmAlloc(svc->segment, sizeof *record);
     if (!record)
         return NULL;
@@ -43,8 +42,7 @@ static DemoConnection *record_open(EchoService *svc, int fd, unsigned int peerPo
     return record;
 }
 
-static void record_close(EchoService *svc, DemoConnection *record)
-{
+static void record_close(EchoService *svc, DemoConnection *record) {
     DemoSummary *summary = svc->summary;
     if (record->prev)
         ((DemoConnection *)record->prev)->next = record->next;
@@ -61,8 +59,7 @@ static void record_close(EchoService *svc, DemoConnection *record)
     }
 }
 
-static void serve_connection(void *arg)
-{
+static void serve_connection(void *arg) {
     Connection *conn = arg;
     for (;;) {
         int n = nb_read(conn->fd, conn->buffer, sizeof conn->buffer);
@@ -78,8 +75,7 @@ static void serve_connection(void *arg)
     free(conn);
 }
 
-static void start_connection(EchoService *svc, int fd, unsigned int peerPort)
-{
+static void start_connection(EchoService *svc, int fd, unsigned int peerPort) {
     Connection *conn = malloc(sizeof *conn);
     DemoConnection *record = conn ? record_open(svc, fd, peerPort) : NULL;
     if (!record) {
@@ -99,13 +95,11 @@ static void start_connection(EchoService *svc, int fd, unsigned int peerPort)
     }
 }
 
-static int accept_failure_is_transient(int err)
-{
+static int accept_failure_is_transient(int err) {
     return err == EINTR || err == ECONNABORTED || err == EPROTO;
 }
 
-static void accept_connections(void *arg)
-{
+static void accept_connections(void *arg) {
     EchoService *svc = arg;
     while (!svc->stopping) {
         struct sockaddr_in peer;
@@ -131,8 +125,7 @@ static void accept_connections(void *arg)
     svc->listenFd = -1;
 }
 
-static int open_listener(EchoService *svc, unsigned int port)
-{
+static int open_listener(EchoService *svc, unsigned int port) {
     int fd = socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (fd < 0)
         return -1;
@@ -154,8 +147,7 @@ static int open_listener(EchoService *svc, unsigned int port)
     return 0;
 }
 
-int echo_start(EchoService *svc, ShmHandle *segment, DemoSummary *summary, unsigned int port)
-{
+int echo_start(EchoService *svc, ShmHandle *segment, DemoSummary *summary, unsigned int port) {
     memset(svc, 0, sizeof *svc);
     svc->segment = segment;
     svc->summary = summary;
@@ -173,8 +165,7 @@ int echo_start(EchoService *svc, ShmHandle *segment, DemoSummary *summary, unsig
     return 0;
 }
 
-void echo_stop(EchoService *svc)
-{
+void echo_stop(EchoService *svc) {
     if (svc->stopping)
         return;
     svc->stopping = 1;
@@ -186,8 +177,7 @@ void echo_stop(EchoService *svc)
         shutdown(((DemoConnection *)at)->fd, SHUT_RDWR);
 }
 
-void echo_wait_idle(EchoService *svc)
-{
+void echo_wait_idle(EchoService *svc) {
     while (svc->summary->openConnections > 0) {
         svc->idleWaiter = current_greenthread();
         greenthread_block();

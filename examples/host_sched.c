@@ -1,6 +1,6 @@
-/* The demo host's task scheduler; see host_sched.h. */
+/* The demo host's task scheduler; see demo.h. */
 #define _GNU_SOURCE
-#include "host_sched.h"
+#include "demo.h"
 
 #include <errno.h>
 #include <stdlib.h>
@@ -16,8 +16,7 @@ _Static_assert(offsetof(HostContext, selector) == 0, "SelSetZG takes the selecto
 
 enum { kUsecPerSec = 1000000 };
 
-void host_init(HostContext *host)
-{
+void host_init(HostContext *host) {
     memset(host, 0, sizeof *host);
     host->selector.scheduler = &host->scheduler;
     FD_ZERO(&host->scheduler.readfd);
@@ -26,8 +25,7 @@ void host_init(HostContext *host)
     host->scheduler.max_fd = -1;
 }
 
-void host_destroy(HostContext *host)
-{
+void host_destroy(HostContext *host) {
     while (host->queueHead) {
         HostQueued *next = host->queueHead->next;
         free(host->queueHead);
@@ -45,8 +43,7 @@ void host_destroy(HostContext *host)
     }
 }
 
-int host_post(HostContext *host, HostTaskFn fn, void *arg)
-{
+int host_post(HostContext *host, HostTaskFn fn, void *arg) {
     HostQueued *item = malloc(sizeof *item);
     if (!item)
         return -1;
@@ -61,16 +58,14 @@ int host_post(HostContext *host, HostTaskFn fn, void *arg)
     return 0;
 }
 
-struct timeval host_now(void)
-{
+struct timeval host_now(void) {
     struct timespec now;
     clock_gettime(CLOCK_MONOTONIC, &now);
     struct timeval tv = {.tv_sec = now.tv_sec, .tv_usec = now.tv_nsec / 1000};
     return tv;
 }
 
-struct timeval host_timeval_add_ms(struct timeval t, unsigned int ms)
-{
+struct timeval host_timeval_add_ms(struct timeval t, unsigned int ms) {
     t.tv_sec += ms / 1000;
     t.tv_usec += (long)(ms % 1000) * 1000;
     if (t.tv_usec >= kUsecPerSec) {
@@ -80,8 +75,7 @@ struct timeval host_timeval_add_ms(struct timeval t, unsigned int ms)
     return t;
 }
 
-HostTimed *host_after(HostContext *host, HostList list, unsigned int ms, HostTaskFn fn, void *arg)
-{
+HostTimed *host_after(HostContext *host, HostList list, unsigned int ms, HostTaskFn fn, void *arg) {
     if ((int)list < 0 || list >= HOST_LIST_COUNT)
         return NULL;
     HostTimed *task = calloc(1, sizeof *task);
@@ -101,8 +95,7 @@ HostTimed *host_after(HostContext *host, HostList list, unsigned int ms, HostTas
     return task;
 }
 
-int host_cancel(HostContext *host, HostTimed *task)
-{
+int host_cancel(HostContext *host, HostTimed *task) {
     for (int list = 0; list < HOST_LIST_COUNT; ++list) {
         for (SelHostTask **link = &host->scheduler.timed[list]; *link; link = &(*link)->next) {
             if (*link == &task->link) {
@@ -115,16 +108,14 @@ int host_cancel(HostContext *host, HostTimed *task)
     return 0;
 }
 
-static void recompute_max_fd(HostContext *host)
-{
+static void recompute_max_fd(HostContext *host) {
     int fd = host->scheduler.max_fd;
     while (fd >= 0 && !FD_ISSET(fd, &host->scheduler.readfd))
         --fd;
     host->scheduler.max_fd = fd;
 }
 
-int host_watch_fd(HostContext *host, int fd, HostTaskFn fn, void *arg)
-{
+int host_watch_fd(HostContext *host, int fd, HostTaskFn fn, void *arg) {
     if (fd < 0 || fd >= FD_SETSIZE || !fn) {
         errno = EINVAL;
         return -1;
@@ -137,8 +128,7 @@ int host_watch_fd(HostContext *host, int fd, HostTaskFn fn, void *arg)
     return 0;
 }
 
-void host_unwatch_fd(HostContext *host, int fd)
-{
+void host_unwatch_fd(HostContext *host, int fd) {
     if (fd < 0 || fd >= FD_SETSIZE)
         return;
     FD_CLR(fd, &host->scheduler.readfd);
@@ -150,8 +140,7 @@ void host_unwatch_fd(HostContext *host, int fd)
 
 /* ---- the functions the select loop calls --------------------------------- */
 
-int thread_fetch_queued(void *hostContext, void *task)
-{
+int thread_fetch_queued(void *hostContext, void *task) {
     HostContext *host = hostContext;
     HostQueued *item = host->queueHead;
     if (!item)
@@ -164,16 +153,14 @@ int thread_fetch_queued(void *hostContext, void *task)
     return 1;
 }
 
-int thread_call(void *task)
-{
+int thread_call(void *task) {
     HostTaskRecord record;
     memcpy(&record, task, sizeof record);
     record.fn(record.arg);
     return 0;
 }
 
-static int queue_readable_watches(HostContext *host)
-{
+static int queue_readable_watches(HostContext *host) {
     if (host->scheduler.max_fd < 0)
         return 0;
     fd_set ready = host->scheduler.readfd;
@@ -192,8 +179,7 @@ static int queue_readable_watches(HostContext *host)
     return queued;
 }
 
-static int queue_due_timed(HostContext *host)
-{
+static int queue_due_timed(HostContext *host) {
     struct timeval now;
     pal_time_tzcurrent(&now, NULL);
     int queued = 0;
@@ -212,14 +198,12 @@ static int queue_due_timed(HostContext *host)
     return queued;
 }
 
-int thread_select_nb(void *hostContext)
-{
+int thread_select_nb(void *hostContext) {
     HostContext *host = hostContext;
     return queue_readable_watches(host) + queue_due_timed(host);
 }
 
-int timeval_cmp(struct timeval a, struct timeval b)
-{
+int timeval_cmp(struct timeval a, struct timeval b) {
     if (a.tv_sec != b.tv_sec)
         return a.tv_sec < b.tv_sec ? -1 : 1;
     if (a.tv_usec != b.tv_usec)
@@ -227,8 +211,7 @@ int timeval_cmp(struct timeval a, struct timeval b)
     return 0;
 }
 
-struct timeval timeval_sub(struct timeval a, struct timeval b)
-{
+struct timeval timeval_sub(struct timeval a, struct timeval b) {
     struct timeval d = {.tv_sec = a.tv_sec - b.tv_sec, .tv_usec = a.tv_usec - b.tv_usec};
     if (d.tv_usec < 0) {
         d.tv_sec -= 1;
@@ -237,8 +220,7 @@ struct timeval timeval_sub(struct timeval a, struct timeval b)
     return d;
 }
 
-int pal_time_tzcurrent(struct timeval *now, void *unused)
-{
+int pal_time_tzcurrent(struct timeval *now, void *unused) {
     (void)unused;
     *now = host_now();
     return 0;

@@ -17,9 +17,6 @@
 #include <unistd.h>
 
 #include "demo.h"
-#include "inspect.h"
-#include "selftest.h"
-#include "snmp_agent.h"
 
 enum {
     kExitOk = 0,
@@ -61,109 +58,61 @@ static const char kUsage[] =
 
 static volatile sig_atomic_t signalWritePipe = -1;
 
-/* ---- small helpers -------------------------------------------------------- */
-
-double demo_seconds_since(const struct timespec *since)
-{
+double demo_seconds_since(const struct timespec *since) {
     struct timespec now;
     SelGetTime(&now);
     return (double)(now.tv_sec - since->tv_sec) + (double)(now.tv_nsec - since->tv_nsec) / 1e9;
 }
 
-static int parse_unsigned(const char *text, unsigned long long max, unsigned long long *value)
-{
-    char *end;
-    errno = 0;
-    unsigned long long parsed = strtoull(text, &end, 0);
-    if (errno != 0 || end == text || *end != '\0' || text[0] == '-' || parsed > max)
-        return -1;
-    *value = parsed;
-    return 0;
-}
-
 /* ---- options -------------------------------------------------------------- */
 
+/* The numeric options come first: their ids index kNumeric. */
 enum OptionId {
-    OPT_PORT = 1000, OPT_SNMP_PORT, OPT_SEGMENT, OPT_SEGMENT_SIZE, OPT_SEGMENT_ADDRESS,
-    OPT_STATUS, OPT_SELF_TEST, OPT_CLIENTS, OPT_ROUNDS, OPT_INSPECT, OPT_HELP
+    OPT_PORT = 1000, OPT_SNMP_PORT, OPT_SEGMENT_SIZE, OPT_SEGMENT_ADDRESS, OPT_STATUS, OPT_CLIENTS, OPT_ROUNDS,
+    OPT_SEGMENT, OPT_SELF_TEST, OPT_INSPECT, OPT_HELP
 };
 
 static const struct option kOptions[] = {
     {"port", required_argument, NULL, OPT_PORT},
     {"snmp-port", required_argument, NULL, OPT_SNMP_PORT},
-    {"segment", required_argument, NULL, OPT_SEGMENT},
     {"segment-size", required_argument, NULL, OPT_SEGMENT_SIZE},
     {"segment-address", required_argument, NULL, OPT_SEGMENT_ADDRESS},
     {"status-interval", required_argument, NULL, OPT_STATUS},
-    {"self-test", no_argument, NULL, OPT_SELF_TEST},
     {"clients", required_argument, NULL, OPT_CLIENTS},
     {"rounds", required_argument, NULL, OPT_ROUNDS},
+    {"segment", required_argument, NULL, OPT_SEGMENT},
+    {"self-test", no_argument, NULL, OPT_SELF_TEST},
     {"inspect", required_argument, NULL, OPT_INSPECT},
     {"help", no_argument, NULL, OPT_HELP},
     {NULL, 0, NULL, 0},
 };
 
-typedef struct OptionLimits {
-    int id;
-    const char *name;
-    unsigned long long min, max;
-} OptionLimits;
-
-static const OptionLimits kNumericOptions[] = {
-    {OPT_PORT, "--port", 0, 65535},
-    {OPT_SNMP_PORT, "--snmp-port", 0, 65535},
-    {OPT_SEGMENT_SIZE, "--segment-size", 4096, 0x40000000u},
-    {OPT_SEGMENT_ADDRESS, "--segment-address", 4096, UINTPTR_MAX},
-    {OPT_STATUS, "--status-interval", 10, 3600000},
-    {OPT_CLIENTS, "--clients", 1, kMaxClients},
-    {OPT_ROUNDS, "--rounds", 1, 100000},
+/* Default, self-test default, least and greatest value of each numeric option. */
+static const struct {
+    unsigned long long standard, selfTest, min, max;
+} kNumeric[OPT_SEGMENT - OPT_PORT] = {
+    {kDefaultPort, 0, 0, 65535},
+    {kDefaultSnmpPort, 0, 0, 65535},
+    {DEMO_SEGMENT_SIZE, DEMO_SEGMENT_SIZE, 4096, 0x40000000u},
+    {DEMO_SEGMENT_ADDRESS, DEMO_SEGMENT_ADDRESS, 4096, UINTPTR_MAX},
+    {kDefaultStatusMs, kSelfTestStatusMs, 10, 3600000},
+    {kDefaultClients, kDefaultClients, 1, kMaxClients},
+    {kDefaultRounds, kDefaultRounds, 1, 100000},
 };
 
-static int parse_numeric_option(int id, const char *text, unsigned long long *value)
-{
-    for (size_t i = 0; i < sizeof kNumericOptions / sizeof kNumericOptions[0]; ++i) {
-        const OptionLimits *limits = &kNumericOptions[i];
-        if (limits->id != id)
-            continue;
-        if (parse_unsigned(text, limits->max, value) != 0 || *value < limits->min) {
-            fprintf(stderr, "qorbu-demo: %s wants a number from %llu to %llu, not '%s'\n", limits->name,
-                    limits->min, limits->max, text);
-            return -1;
-        }
-        return 0;
-    }
-    return -1;
-}
-
-static void apply_numeric_option(DemoOptions *options, int id, unsigned long long value, int *portSet,
-                                 int *snmpPortSet, int *statusSet)
-{
-    switch (id) {
-    case OPT_PORT: options->port = (unsigned int)value; *portSet = 1; break;
-    case OPT_SNMP_PORT: options->snmpPort = (unsigned int)value; *snmpPortSet = 1; break;
-    case OPT_SEGMENT_SIZE: options->segmentSize = (uint32_t)value; break;
-    case OPT_SEGMENT_ADDRESS: options->segmentAddress = (uintptr_t)value; break;
-    case OPT_STATUS: options->statusIntervalMs = (unsigned int)value; *statusSet = 1; break;
-    case OPT_CLIENTS: options->clients = (unsigned int)value; break;
-    case OPT_ROUNDS: options->rounds = (unsigned int)value; break;
-    default: break;
-    }
-}
-
 /* 0: run; 1: done (help printed); -1: bad command line. */
-static int parse_options(int argc, char **argv, DemoOptions *options, char *nameBuffer, size_t nameSize)
-{
-    *options = (DemoOptions){.clients = kDefaultClients, .rounds = kDefaultRounds, .port = kDefaultPort,
-                             .snmpPort = kDefaultSnmpPort, .segmentName = "qorbu-demo",
-                             .segmentSize = DEMO_SEGMENT_SIZE, .segmentAddress = DEMO_SEGMENT_ADDRESS,
-                             .statusIntervalMs = kDefaultStatusMs};
-    int portSet = 0, snmpPortSet = 0, statusSet = 0, segmentSet = 0, option;
+static int parse_options(int argc, char **argv, DemoOptions *options, char *nameBuffer, size_t nameSize) {
+    enum { kCount = OPT_SEGMENT - OPT_PORT };
+    unsigned long long value[kCount];
+    int given[kCount] = {0}, option;
+    *options = (DemoOptions){.segmentName = NULL};
     opterr = 0;
     while ((option = getopt_long(argc, argv, "h", kOptions, NULL)) != -1) {
-        unsigned long long value;
+        const int k = option - OPT_PORT;
+        char *end;
         switch (option) {
         case OPT_SELF_TEST: options->selfTest = 1; break;
-        case OPT_SEGMENT: options->segmentName = optarg; segmentSet = 1; break;
+        case OPT_SEGMENT: options->segmentName = optarg; break;
         case OPT_INSPECT: options->inspect = optarg; break;
         case OPT_HELP:
         case 'h': fputs(kUsage, stdout); return 1;
@@ -171,51 +120,53 @@ static int parse_options(int argc, char **argv, DemoOptions *options, char *name
             fprintf(stderr, "qorbu-demo: unknown option or missing value: %s (try --help)\n", argv[optind - 1]);
             return -1;
         default:
-            if (parse_numeric_option(option, optarg, &value) != 0)
+            errno = 0;
+            value[k] = strtoull(optarg, &end, 0);
+            if (errno != 0 || end == optarg || *end != '\0' || optarg[0] == '-' || value[k] < kNumeric[k].min ||
+                value[k] > kNumeric[k].max) {
+                fprintf(stderr, "qorbu-demo: --%s wants a number from %llu to %llu, not '%s'\n", kOptions[k].name,
+                        kNumeric[k].min, kNumeric[k].max, optarg);
                 return -1;
-            apply_numeric_option(options, option, value, &portSet, &snmpPortSet, &statusSet);
+            }
+            given[k] = 1;
         }
     }
     if (optind < argc) {
         fprintf(stderr, "qorbu-demo: unexpected argument '%s' (try --help)\n", argv[optind]);
         return -1;
     }
+    for (int k = 0; k < kCount; ++k)
+        if (!given[k])
+            value[k] = options->selfTest ? kNumeric[k].selfTest : kNumeric[k].standard;
+    options->port = (unsigned int)value[OPT_PORT - OPT_PORT];
+    options->snmpPort = (unsigned int)value[OPT_SNMP_PORT - OPT_PORT];
+    options->segmentSize = (uint32_t)value[OPT_SEGMENT_SIZE - OPT_PORT];
+    options->segmentAddress = (uintptr_t)value[OPT_SEGMENT_ADDRESS - OPT_PORT];
+    options->statusIntervalMs = (unsigned int)value[OPT_STATUS - OPT_PORT];
+    options->clients = (unsigned int)value[OPT_CLIENTS - OPT_PORT];
+    options->rounds = (unsigned int)value[OPT_ROUNDS - OPT_PORT];
     if (options->segmentAddress % 4096 != 0) {
         fprintf(stderr, "qorbu-demo: --segment-address must be a multiple of 4096\n");
         return -1;
     }
-    if (options->selfTest) {
-        if (!portSet)
-            options->port = 0;
-        if (!snmpPortSet)
-            options->snmpPort = 0;
-        if (!statusSet)
-            options->statusIntervalMs = kSelfTestStatusMs;
-        if (!segmentSet) {
-            snprintf(nameBuffer, nameSize, "qorbu-demo-selftest-%d", (int)getpid());
-            options->segmentName = nameBuffer;
-        }
+    if (!options->segmentName && options->selfTest) {
+        snprintf(nameBuffer, nameSize, "qorbu-demo-selftest-%d", (int)getpid());
+        options->segmentName = nameBuffer;
+    } else if (!options->segmentName) {
+        options->segmentName = "qorbu-demo";
     }
     return 0;
 }
 
 /* ---- the segment ---------------------------------------------------------- */
 
-static int segment_exists(const char *name)
-{
-    char object[256];
-    snprintf(object, sizeof object, "/%s", name);
-    int fd = shm_open(object, O_RDONLY, 0);
-    if (fd < 0)
-        return 0;
-    close(fd);
-    return 1;
-}
-
-static int create_segment(Demo *demo)
-{
+static int create_segment(Demo *demo) {
     const DemoOptions *options = &demo->options;
-    if (segment_exists(options->segmentName)) {
+    char object[256];
+    snprintf(object, sizeof object, "/%s", options->segmentName);
+    int fd = shm_open(object, O_RDONLY, 0);
+    if (fd >= 0) {
+        close(fd);
         fprintf(stderr, "qorbu-demo: segment %s already exists (another qorbu-demo? remove it with "
                         "'qorbu-shm unlink %s')\n", options->segmentName, options->segmentName);
         return -1;
@@ -239,8 +190,7 @@ static int create_segment(Demo *demo)
     return 0;
 }
 
-static void remove_segment(Demo *demo)
-{
+static void remove_segment(Demo *demo) {
     if (!demo->segment)
         return;
     ShmClose(demo->segment);
@@ -249,21 +199,15 @@ static void remove_segment(Demo *demo)
     ShmUnlink(demo->options.segmentName);
 }
 
-/* ---- the SNMP agent's view ------------------------------------------------ */
+/* ---- the SNMP agent -------------------------------------------------------- */
 
-static uint32_t agent_open_connections(void *arg) { return ((Demo *)arg)->summary->openConnections; }
-static uint64_t agent_bytes_echoed(void *arg) { return ((Demo *)arg)->summary->bytesEchoed; }
-static uint32_t agent_segment_free(void *arg) { return ShmTotalFree(((Demo *)arg)->segment); }
-
-static int remove_entry(const char *path, const struct stat *st, int flag, struct FTW *ftw)
-{
+static int remove_entry(const char *path, const struct stat *st, int flag, struct FTW *ftw) {
     (void)st, (void)flag, (void)ftw;
     remove(path);
     return 0;
 }
 
-static int start_agent(Demo *demo)
-{
+static int start_agent(Demo *demo) {
     strcpy(demo->stateDir, "/tmp/qorbu-demo-snmp-XXXXXX");
     if (!mkdtemp(demo->stateDir)) {
         perror("qorbu-demo: mkdtemp");
@@ -274,12 +218,10 @@ static int start_agent(Demo *demo)
     setenv("SNMPCONFPATH", demo->stateDir, 1);
     setenv("SNMP_PERSISTENT_DIR", demo->stateDir, 1);
     demo->snmpPort = demo->options.snmpPort ? demo->options.snmpPort : agent_pick_free_port();
-    AgentSource source = {agent_open_connections, agent_bytes_echoed, agent_segment_free, demo};
-    return agent_start(&source, demo->snmpPort, demo->stateDir);
+    return agent_start(demo->segment, demo->summary, demo->snmpPort, demo->stateDir);
 }
 
-static void stop_agent(Demo *demo)
-{
+static void stop_agent(Demo *demo) {
     agent_stop();
     if (demo->stateDir[0])
         nftw(demo->stateDir, remove_entry, 8, FTW_DEPTH | FTW_PHYS);
@@ -287,8 +229,7 @@ static void stop_agent(Demo *demo)
 
 /* ---- status line ---------------------------------------------------------- */
 
-static void log_status(Demo *demo)
-{
+static void log_status(Demo *demo) {
     ++demo->statusLines;
     fprintf(stderr,
             "qorbu-demo: status: %u connections open, %u accepted, %llu bytes echoed, %u of %u segment "
@@ -298,8 +239,7 @@ static void log_status(Demo *demo)
             demo_seconds_since(&demo->started));
 }
 
-static int on_status_timer(SelTimer *timer)
-{
+static int on_status_timer(SelTimer *timer) {
     Demo *demo = timer->arg;
     log_status(demo);
     if (!demo->stopping)
@@ -309,15 +249,13 @@ static int on_status_timer(SelTimer *timer)
 
 /* ---- stopping ------------------------------------------------------------- */
 
-static void on_stop_grace_expired(void *arg)
-{
+static void on_stop_grace_expired(void *arg) {
     (void)arg;
     fprintf(stderr, "qorbu-demo: connections did not close within %d ms, exiting\n", kStopGraceMs);
     _exit(kExitFailure);
 }
 
-static void stop_now(void *arg)
-{
+static void stop_now(void *arg) {
     Demo *demo = arg;
     if (demo->stopping)
         return;
@@ -329,8 +267,7 @@ static void stop_now(void *arg)
     host_after(&demo->host, HOST_LIST_URGENT, kStopGraceMs, on_stop_grace_expired, demo);
 }
 
-void demo_request_stop(Demo *demo, const char *reason)
-{
+void demo_request_stop(Demo *demo, const char *reason) {
     if (!demo->stopping)
         fprintf(stderr, "qorbu-demo: stopping: %s\n", reason);
     host_post(&demo->host, stop_now, demo);
@@ -338,8 +275,7 @@ void demo_request_stop(Demo *demo, const char *reason)
 
 /* The handlers only note the signal in a pipe that the host scheduler
  * watches; the stop itself runs as a host task on the loop. */
-static void on_signal(int signo)
-{
+static void on_signal(int signo) {
     int saved = errno;
     unsigned char byte = (unsigned char)signo;
     if (signalWritePipe >= 0 && write(signalWritePipe, &byte, 1) < 0) {
@@ -348,8 +284,7 @@ static void on_signal(int signo)
     errno = saved;
 }
 
-static void on_signal_pipe(void *arg)
-{
+static void on_signal_pipe(void *arg) {
     Demo *demo = arg;
     unsigned char bytes[16];
     ssize_t n = read(demo->signalPipe[0], bytes, sizeof bytes);
@@ -357,8 +292,7 @@ static void on_signal_pipe(void *arg)
         demo_request_stop(demo, bytes[n - 1] == SIGINT ? "SIGINT" : "SIGTERM");
 }
 
-static int install_signals(Demo *demo)
-{
+static int install_signals(Demo *demo) {
     if (pipe2(demo->signalPipe, O_CLOEXEC | O_NONBLOCK) != 0)
         return -1;
     signalWritePipe = demo->signalPipe[1];
@@ -379,8 +313,7 @@ static int install_signals(Demo *demo)
 
 /* ---- the daemon ----------------------------------------------------------- */
 
-static int start(Demo *demo)
-{
+static int start(Demo *demo) {
     if (SelInit() != 0) {
         perror("qorbu-demo: SelInit");
         return -1;
@@ -409,8 +342,7 @@ static int start(Demo *demo)
     return 0;
 }
 
-static void finish(Demo *demo)
-{
+static void finish(Demo *demo) {
     SelRemTimer(&demo->statusTimer);
     if (demo->summary)
         log_status(demo);
@@ -421,8 +353,7 @@ static void finish(Demo *demo)
     signalWritePipe = -1;
 }
 
-static int run_daemon(Demo *demo)
-{
+static int run_daemon(Demo *demo) {
     SelGetTime(&demo->started);
     demo->signalPipe[0] = demo->signalPipe[1] = -1;
     if (start(demo) != 0) {
@@ -442,8 +373,7 @@ static int run_daemon(Demo *demo)
     return status;
 }
 
-int main(int argc, char **argv)
-{
+int main(int argc, char **argv) {
     static Demo demo;
     char selfTestName[64];
     int parsed = parse_options(argc, argv, &demo.options, selfTestName, sizeof selfTestName);

@@ -1,19 +1,22 @@
-/* See selftest.h. */
+/* The self-test (see demo.h): its clients, its helpers (snmpget and the
+ * second process, run from a green thread), its controller and verdict. */
 #define _GNU_SOURCE
-#include "selftest.h"
-
 #include <errno.h>
+#include <fcntl.h>
 #include <inttypes.h>
+#include <poll.h>
+#include <signal.h>
+#include <spawn.h>
 #include <stdarg.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
 #include <sys/socket.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include "demo.h"
 #include "nbio/nb.h"
-#include "snmp_agent.h"
-#include "helper.h"
 
 enum {
     kMaxChunk = 4096,
@@ -75,8 +78,7 @@ struct SelfTest {
 
 /* ---- the checks ----------------------------------------------------------- */
 
-__attribute__((format(printf, 3, 4))) static void check(SelfTest *test, int held, const char *format, ...)
-{
+__attribute__((format(printf, 3, 4))) static void check(SelfTest *test, int held, const char *format, ...) {
     ++test->checks;
     if (held) {
         ++test->held;
@@ -93,8 +95,7 @@ __attribute__((format(printf, 3, 4))) static void check(SelfTest *test, int held
 
 /* ---- clients -------------------------------------------------------------- */
 
-static uint32_t next_random(uint32_t *state)
-{
+static uint32_t next_random(uint32_t *state) {
     uint32_t x = *state; /* xorshift32 */
     x ^= x << 13;
     x ^= x >> 17;
@@ -102,8 +103,7 @@ static uint32_t next_random(uint32_t *state)
     return *state = x;
 }
 
-static int connect_client(Client *client)
-{
+static int connect_client(Client *client) {
     client->fd = socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (client->fd < 0)
         return -1;
@@ -111,8 +111,7 @@ static int connect_client(Client *client)
     return nb_connect(client->fd, (const struct sockaddr *)to, sizeof *to);
 }
 
-static int echo_round(Client *client)
-{
+static int echo_round(Client *client) {
     size_t len = 1 + next_random(&client->random) % kMaxChunk;
     for (size_t i = 0; i < len; ++i)
         client->out[i] = (unsigned char)next_random(&client->random);
@@ -127,14 +126,12 @@ static int echo_round(Client *client)
     return 0;
 }
 
-static void client_finished_echoing(SelfTest *test)
-{
+static void client_finished_echoing(SelfTest *test) {
     if (--test->pending == 0 && test->controllerWaiting)
         greenthread_wakeup(test->controller);
 }
 
-static void run_client(void *arg)
-{
+static void run_client(void *arg) {
     Client *client = arg;
     SelfTest *test = client->test;
     if (connect_client(client) == 0) {
@@ -157,8 +154,7 @@ static void run_client(void *arg)
     client->fd = -1;
 }
 
-static void release_clients(SelfTest *test)
-{
+static void release_clients(SelfTest *test) {
     test->released = 1;
     for (unsigned int i = 0; i < test->clientCount; ++i)
         if (test->clients[i].waiting)
@@ -167,8 +163,106 @@ static void release_clients(SelfTest *test)
 
 /* ---- snmpget and the second process --------------------------------------- */
 
-static int parse_snmp_value(const char *output, const char *oid, uint64_t *value)
-{
+extern char **environ;
+
+/* The helper starts with an empty signal mask and default dispositions,
+ * whatever the daemon blocks (its registered signals) or ignores (SIGPIPE). */
+static int prepare_attributes(posix_spawnattr_t *attr) {
+    sigset_t none, defaults;
+    sigemptyset(&none);
+    sigemptyset(&defaults);
+    sigaddset(&defaults, SIGPIPE);
+    sigaddset(&defaults, SIGINT);
+    sigaddset(&defaults, SIGTERM);
+    if (posix_spawnattr_init(attr) != 0)
+        return -1;
+    posix_spawnattr_setsigmask(attr, &none);
+    posix_spawnattr_setsigdefault(attr, &defaults);
+    posix_spawnattr_setflags(attr, POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF);
+    return 0;
+}
+
+static int start_helper(char *const argv[], int *readEnd, pid_t *pid) {
+    int pipeFds[2];
+    if (pipe2(pipeFds, O_CLOEXEC | O_NONBLOCK) != 0)
+        return errno;
+    posix_spawn_file_actions_t actions;
+    posix_spawnattr_t attr;
+    posix_spawn_file_actions_init(&actions);
+    posix_spawn_file_actions_adddup2(&actions, pipeFds[1], STDOUT_FILENO);
+    int err = prepare_attributes(&attr) == 0 ? 0 : ENOMEM;
+    if (err == 0) {
+        err = posix_spawnp(pid, argv[0], &actions, &attr, argv, environ);
+        posix_spawnattr_destroy(&attr);
+    }
+    posix_spawn_file_actions_destroy(&actions);
+    close(pipeFds[1]);
+    if (err != 0) {
+        close(pipeFds[0]);
+        return err;
+    }
+    *readEnd = pipeFds[0];
+    return 0;
+}
+
+/* Reads until end of file; 0, or -1 when the helper stayed silent too long. */
+static int read_output(int fd, char *out, size_t cap, int timeoutMs) {
+    size_t used = 0;
+    char discard[256];
+    for (;;) {
+        if (nb_poll(fd, POLLIN, timeoutMs) < 0) {
+            out[used] = '\0';
+            return -1;
+        }
+        const int room = used + 1 < cap;
+        ssize_t n = read(fd, room ? out + used : discard, room ? cap - 1 - used : sizeof discard);
+        if (n > 0 && room)
+            used += (size_t)n;
+        else if (n == 0 || (n < 0 && errno != EAGAIN && errno != EINTR))
+            break;
+    }
+    out[used] = '\0';
+    return 0;
+}
+
+/* Runs argv[0] (looked up in PATH) with argv, captures up to cap - 1 bytes
+ * of its standard output into out (NUL-terminated) and waits for it, while
+ * the loop (and the SNMP agent the helper may be talking to) keeps running:
+ * the output is read through a non-blocking pipe with nb_poll. A helper
+ * silent for longer than timeoutMs is killed. Returns its exit status
+ * (0..255), or -1 with a message in out when it could not be run, was
+ * killed or died of a signal. */
+static int spawn_capture(char *const argv[], char *out, size_t cap, int timeoutMs) {
+    int fd;
+    pid_t pid;
+    int err = start_helper(argv, &fd, &pid);
+    if (err != 0) {
+        snprintf(out, cap, "cannot run %s: %s", argv[0], strerror(err));
+        return -1;
+    }
+    int silent = read_output(fd, out, cap, timeoutMs);
+    close(fd);
+    if (silent)
+        kill(pid, SIGKILL);
+    int status;
+    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+    }
+    if (silent) {
+        snprintf(out, cap, "%s gave no answer within %d ms", argv[0], timeoutMs);
+        return -1;
+    }
+    if (WIFEXITED(status) && WEXITSTATUS(status) == 127 && out[0] == '\0') {
+        snprintf(out, cap, "cannot run %s", argv[0]);
+        return -1;
+    }
+    if (!WIFEXITED(status)) {
+        snprintf(out, cap, "%s died of signal %d", argv[0], WIFSIGNALED(status) ? WTERMSIG(status) : 0);
+        return -1;
+    }
+    return WEXITSTATUS(status);
+}
+
+static int parse_snmp_value(const char *output, const char *oid, uint64_t *value) {
     char prefix[96];
     snprintf(prefix, sizeof prefix, ".%s = ", oid);
     const char *line = strstr(output, prefix);
@@ -186,8 +280,7 @@ static int parse_snmp_value(const char *output, const char *oid, uint64_t *value
     return 0;
 }
 
-static void query_agent(SelfTest *test)
-{
+static void query_agent(SelfTest *test) {
     char target[48], output[kHelperOutputSize];
     snprintf(target, sizeof target, "udp:127.0.0.1:%u", test->demo->snmpPort);
     char *argv[] = {"snmpget", "-v2c", "-c", "public", "-On", "-t", "2", "-r", "2", target,
@@ -202,8 +295,7 @@ static void query_agent(SelfTest *test)
                 status < 0 ? output : "unexpected answer");
 }
 
-static void read_segment_from_second_process(SelfTest *test)
-{
+static void read_segment_from_second_process(SelfTest *test) {
     char self[4096], output[kHelperOutputSize];
     ssize_t len = readlink("/proc/self/exe", self, sizeof self - 1);
     if (len <= 0) {
@@ -223,79 +315,76 @@ static void read_segment_from_second_process(SelfTest *test)
 
 /* ---- the controller ------------------------------------------------------- */
 
-static void wait_for_clients(SelfTest *test)
-{
-    while (test->pending > 0) {
-        test->controllerWaiting = 1;
-        greenthread_block();
+/* What the clients did, counted once for the checks and the summary. */
+typedef struct Tally {
+    unsigned int connected, verified, roundTrips;
+    uint64_t sent;
+} Tally;
+
+static Tally count_clients(const SelfTest *test) {
+    Tally t = {0, 0, 0, 0};
+    for (const Client *c = test->clients; c < test->clients + test->clientCount; ++c) {
+        t.connected += (unsigned int)c->connected;
+        t.verified += (unsigned int)c->verified;
+        t.roundTrips += c->roundTrips;
+        t.sent += c->bytes;
     }
-    test->controllerWaiting = 0;
+    return t;
 }
 
-static void evaluate(SelfTest *test)
-{
-    unsigned int connected = 0, verified = 0;
-    uint64_t sent = 0;
-    for (unsigned int i = 0; i < test->clientCount; ++i) {
-        connected += (unsigned int)test->clients[i].connected;
-        verified += (unsigned int)test->clients[i].verified;
-        sent += test->clients[i].bytes;
-    }
-    const DemoSummary *summary = test->demo->summary;
-    const uint64_t echoed = summary->bytesEchoed;
-    check(test, connected == test->clientCount, "%u of %u clients connected", connected, test->clientCount);
-    check(test, verified == test->clientCount, "%u of %u clients got every byte back", verified,
-          test->clientCount);
-    check(test, echoed == sent, "the service echoed %" PRIu64 " bytes, the clients sent %" PRIu64, echoed, sent);
-    check(test, test->snmp.ok, "snmpget gave no usable answer");
-    if (test->snmp.ok) {
-        check(test, test->snmp.openConnections == test->clientCount,
-              "SNMP open connections %" PRIu64 ", expected %u", test->snmp.openConnections, test->clientCount);
-        check(test, test->snmp.bytesEchoed == echoed, "SNMP bytes echoed %" PRIu64 ", expected %" PRIu64,
-              test->snmp.bytesEchoed, echoed);
-        check(test, test->snmp.segmentFree == test->freeWhileOpen,
-              "SNMP segment free %" PRIu64 ", expected %u", test->snmp.segmentFree, test->freeWhileOpen);
-    }
+/* The 14 checks. */
+static void evaluate(SelfTest *test, const Tally *t) {
+    const unsigned int n = test->clientCount, freeWhileOpen = test->freeWhileOpen;
+    const uint64_t echoed = test->demo->summary->bytesEchoed;
+    const SnmpAnswers *snmp = &test->snmp;
     const SecondProcess *second = &test->second;
+    check(test, t->connected == n, "%u of %u clients connected", t->connected, n);
+    check(test, t->verified == n, "%u of %u clients got every byte back", t->verified, n);
+    check(test, echoed == t->sent, "the service echoed %" PRIu64 " bytes, the clients sent %" PRIu64, echoed,
+          t->sent);
+    check(test, snmp->ok, "snmpget gave no usable answer");
+    if (snmp->ok) {
+        check(test, snmp->openConnections == n, "SNMP open connections %" PRIu64 ", expected %u",
+              snmp->openConnections, n);
+        check(test, snmp->bytesEchoed == echoed, "SNMP bytes echoed %" PRIu64 ", expected %" PRIu64,
+              snmp->bytesEchoed, echoed);
+        check(test, snmp->segmentFree == freeWhileOpen, "SNMP segment free %" PRIu64 ", expected %u",
+              snmp->segmentFree, freeWhileOpen);
+    }
     check(test, second->ok, "the second process could not read the segment");
     if (second->ok) {
         check(test, second->pid == test->demo->summary->pid, "the second process saw owner pid %d, not %d",
               second->pid, test->demo->summary->pid);
-        check(test, second->records == test->clientCount, "the second process saw %u records, expected %u",
-              second->records, test->clientCount);
+        check(test, second->records == n, "the second process saw %u records, expected %u", second->records, n);
         check(test, second->bytes == echoed && second->recordBytes == echoed,
               "the second process saw %llu bytes (%llu in records), expected %" PRIu64, second->bytes,
               second->recordBytes, echoed);
-        check(test, second->freeBytes == test->freeWhileOpen, "the second process counted %u free bytes, expected %u",
-              second->freeBytes, test->freeWhileOpen);
+        check(test, second->freeBytes == freeWhileOpen, "the second process counted %u free bytes, expected %u",
+              second->freeBytes, freeWhileOpen);
     }
     check(test, test->freeAfter == test->demo->freeAtStart,
           "free bytes %u after the clients left, %u before: records leaked", test->freeAfter,
           test->demo->freeAtStart);
+    check(test, !test->stopping, "the self-test was interrupted%s", test->timedOut ? " by its deadline" : "");
 }
 
-static void print_summary(const SelfTest *test)
-{
-    unsigned int connected = 0, roundTrips = 0;
-    for (unsigned int i = 0; i < test->clientCount; ++i) {
-        connected += (unsigned int)test->clients[i].connected;
-        roundTrips += test->clients[i].roundTrips;
-    }
+static void print_summary(const SelfTest *test, const Tally *t) {
+    const SnmpAnswers *snmp = &test->snmp;
+    const SecondProcess *second = &test->second;
     const double seconds = test->echoSeconds > 0 ? test->echoSeconds : 1e-9;
     printf("qorbu-demo self-test\n");
-    printf("  connections     %u of %u clients connected\n", connected, test->clientCount);
+    printf("  connections     %u of %u clients connected\n", t->connected, test->clientCount);
     printf("  bytes echoed    %" PRIu64 "\n", test->demo->summary->bytesEchoed);
-    printf("  round trips     %u in %.3f s, %.0f per second\n", roundTrips, test->echoSeconds,
-           roundTrips / seconds);
-    if (test->snmp.ok)
+    printf("  round trips     %u in %.3f s, %.0f per second\n", t->roundTrips, test->echoSeconds,
+           t->roundTrips / seconds);
+    if (snmp->ok)
         printf("  snmpget         open connections %" PRIu64 ", bytes echoed %" PRIu64 ", segment free %" PRIu64
-               "\n",
-               test->snmp.openConnections, test->snmp.bytesEchoed, test->snmp.segmentFree);
+               "\n", snmp->openConnections, snmp->bytesEchoed, snmp->segmentFree);
     else
         printf("  snmpget         no answer\n");
-    if (test->second.ok)
-        printf("  second process  %u records, %llu bytes, %u bytes free\n", test->second.records,
-               test->second.bytes, test->second.freeBytes);
+    if (second->ok)
+        printf("  second process  %u records, %llu bytes, %u bytes free\n", second->records, second->bytes,
+               second->freeBytes);
     else
         printf("  second process  no answer\n");
     printf("  segment free    %u bytes before, %u with the clients connected, %u after\n",
@@ -307,11 +396,14 @@ static void print_summary(const SelfTest *test)
     fflush(stdout);
 }
 
-static void run_controller(void *arg)
-{
+static void run_controller(void *arg) {
     SelfTest *test = arg;
     Demo *demo = test->demo;
-    wait_for_clients(test);
+    while (test->pending > 0) { /* woken by the last client to finish echoing */
+        test->controllerWaiting = 1;
+        greenthread_block();
+    }
+    test->controllerWaiting = 0;
     test->echoSeconds = demo_seconds_since(&test->echoStarted);
     if (!test->stopping) {
         test->freeWhileOpen = ShmTotalFree(demo->segment);
@@ -321,15 +413,14 @@ static void run_controller(void *arg)
     release_clients(test);
     echo_wait_idle(&demo->echo);
     test->freeAfter = ShmTotalFree(demo->segment);
-    evaluate(test);
-    check(test, !test->stopping, "the self-test was interrupted%s", test->timedOut ? " by its deadline" : "");
+    const Tally tally = count_clients(test);
+    evaluate(test, &tally);
     test->finished = 1;
-    print_summary(test);
+    print_summary(test, &tally);
     demo_request_stop(demo, "self-test finished");
 }
 
-static void on_deadline(void *arg)
-{
+static void on_deadline(void *arg) {
     SelfTest *test = arg;
     test->deadline = NULL;
     if (test->finished)
@@ -341,8 +432,7 @@ static void on_deadline(void *arg)
 
 /* ---- the interface -------------------------------------------------------- */
 
-SelfTest *selftest_start(Demo *demo)
-{
+SelfTest *selftest_start(Demo *demo) {
     SelfTest *test = calloc(1, sizeof *test);
     unsigned int count = demo->options.clients;
     Client *clients = test ? calloc(count, sizeof *clients) : NULL;
@@ -374,8 +464,7 @@ SelfTest *selftest_start(Demo *demo)
     return test;
 }
 
-void selftest_stop(SelfTest *test)
-{
+void selftest_stop(SelfTest *test) {
     if (test->finished || test->stopping)
         return;
     test->stopping = 1;
@@ -388,13 +477,11 @@ void selftest_stop(SelfTest *test)
     }
 }
 
-int selftest_passed(const SelfTest *test)
-{
+int selftest_passed(const SelfTest *test) {
     return test->finished && test->checks > 0 && test->held == test->checks;
 }
 
-void selftest_free(SelfTest *test)
-{
+void selftest_free(SelfTest *test) {
     if (!test)
         return;
     if (test->deadline)

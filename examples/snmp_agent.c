@@ -1,8 +1,8 @@
-/* The demo's SNMP agent; see snmp_agent.h. Compiled without
+/* The demo's SNMP agent; see demo.h. Compiled without
  * `net-snmp-config --cflags`, whose large-file flags would change off_t
  * for the rest of the program. */
 #define _GNU_SOURCE
-#include "snmp_agent.h"
+#include "demo.h"
 
 #include <arpa/inet.h>
 #include <netinet/in.h>
@@ -17,45 +17,32 @@
 #include <net-snmp/agent/net-snmp-agent-includes.h>
 
 static const char kAppName[] = "qorbu-demo";
-static AgentSource source;
+static ShmHandle *segment;
+static const DemoSummary *summary;
 static int started;
 
 enum Scalar { SCALAR_OPEN_CONNECTIONS = 1, SCALAR_BYTES_ECHOED = 2, SCALAR_SEGMENT_FREE = 3 };
 
 static int answer_scalar(netsnmp_mib_handler *handler, netsnmp_handler_registration *reg,
-                         netsnmp_agent_request_info *reqinfo, netsnmp_request_info *requests)
-{
+                         netsnmp_agent_request_info *reqinfo, netsnmp_request_info *requests) {
     (void)reg;
     if (reqinfo->mode != MODE_GET)
         return SNMP_ERR_NOERROR;
     const enum Scalar object = (enum Scalar)(uintptr_t)handler->myvoid;
     for (netsnmp_request_info *request = requests; request; request = request->next) {
-        switch (object) {
-        case SCALAR_OPEN_CONNECTIONS: {
-            u_long value = source.openConnections(source.arg);
-            snmp_set_var_typed_value(request->requestvb, ASN_GAUGE, &value, sizeof value);
-            break;
-        }
-        case SCALAR_BYTES_ECHOED: {
-            uint64_t total = source.bytesEchoed(source.arg);
+        if (object == SCALAR_BYTES_ECHOED) {
+            uint64_t total = summary->bytesEchoed;
             struct counter64 value = {.high = (u_long)(total >> 32), .low = (u_long)(total & 0xffffffffu)};
             snmp_set_var_typed_value(request->requestvb, ASN_COUNTER64, &value, sizeof value);
-            break;
-        }
-        case SCALAR_SEGMENT_FREE: {
-            u_long value = source.segmentFreeBytes(source.arg);
+        } else {
+            u_long value = object == SCALAR_OPEN_CONNECTIONS ? summary->openConnections : ShmTotalFree(segment);
             snmp_set_var_typed_value(request->requestvb, ASN_GAUGE, &value, sizeof value);
-            break;
-        }
-        default:
-            netsnmp_set_request_error(reqinfo, request, SNMP_NOSUCHOBJECT);
         }
     }
     return SNMP_ERR_NOERROR;
 }
 
-static int register_scalar(const char *name, enum Scalar object)
-{
+static int register_scalar(const char *name, enum Scalar object) {
     /* DEMO_OID_BASE, then the object; the instance .0 is the handler's. */
     oid root[] = {1, 3, 6, 1, 4, 1, 8072, 9999, 9999, 7, (oid)object};
     netsnmp_handler_registration *reg = netsnmp_create_handler_registration(
@@ -66,8 +53,7 @@ static int register_scalar(const char *name, enum Scalar object)
     return netsnmp_register_scalar(reg) == MIB_REGISTERED_OK ? 0 : -1;
 }
 
-static void configure_library(unsigned int port, const char *stateDir)
-{
+static void configure_library(unsigned int port, const char *stateDir) {
     /* No MIB files, configuration files or persistent state from the system. */
     setenv("MIBS", "", 1);
     setenv("MIBDIRS", "", 1);
@@ -88,9 +74,9 @@ static void configure_library(unsigned int port, const char *stateDir)
     netsnmp_ds_set_string(NETSNMP_DS_APPLICATION_ID, NETSNMP_DS_AGENT_PORTS, ports);
 }
 
-int agent_start(const AgentSource *from, unsigned int port, const char *stateDir)
-{
-    source = *from;
+int agent_start(ShmHandle *theSegment, const DemoSummary *theSummary, unsigned int port, const char *stateDir) {
+    segment = theSegment;
+    summary = theSummary;
     /* Warnings and errors on standard error; no line per request. */
     snmp_disable_log();
     netsnmp_log_handler *log = netsnmp_register_loghandler(NETSNMP_LOGHANDLER_STDERR, LOG_WARNING);
@@ -121,8 +107,7 @@ int agent_start(const AgentSource *from, unsigned int port, const char *stateDir
     return 0;
 }
 
-void agent_stop(void)
-{
+void agent_stop(void) {
     if (!started)
         return;
     started = 0;
@@ -130,8 +115,7 @@ void agent_stop(void)
     shutdown_agent();
 }
 
-unsigned int agent_pick_free_port(void)
-{
+unsigned int agent_pick_free_port(void) {
     int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
     if (fd < 0)
         return 0;

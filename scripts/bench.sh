@@ -1,14 +1,16 @@
 #!/usr/bin/env bash
-# Builds the peer comparisons in a Release tree (build/bench), runs them and
-# writes BENCHMARKS.md with its plots in docs/bench/. Never part of ctest.
+# Builds the peer comparisons (bench/) in a Release tree (build/bench), runs
+# them and writes BENCHMARKS.md: each section's prose from bench/text/, the
+# drivers' tables, and plots drawn with bench/figure.gp into docs/bench/.
+# Never part of ctest.
 #
 #   bash scripts/bench.sh            full run (about 5-8 minutes on 2 cores)
 #   bash scripts/bench.sh --quick    smoke run: fewer repetitions, smaller sizes;
 #                                    writes to build/bench/results only
 #
 # Needs cmake, ninja and g++; installs what else is missing with apt-get:
-# gnuplot-nox, libbenchmark-dev and the peers libevent-dev libev-dev
-# libuv1-dev libboost-dev libboost-context-dev.
+# gnuplot-nox and the peers libevent-dev libev-dev libuv1-dev libboost-dev
+# libboost-context-dev.
 set -euo pipefail
 
 root=$(cd "$(dirname "${BASH_SOURCE[0]}")/.." && pwd)
@@ -18,7 +20,7 @@ quick=0
 [[ ${1:-} == --quick ]] && quick=1
 
 missing=()
-for pkg in libevent-dev libev-dev libuv1-dev libboost-dev libboost-context-dev libbenchmark-dev gnuplot-nox; do
+for pkg in libevent-dev libev-dev libuv1-dev libboost-dev libboost-context-dev gnuplot-nox; do
   dpkg-query -W -f='${Status}' "$pkg" 2>/dev/null | grep -q 'ok installed' || missing+=("$pkg")
 done
 if ((${#missing[@]})); then
@@ -53,9 +55,15 @@ else
 fi
 for p in "${drivers[@]}"; do
   echo "== peer_$p" >&2
-  "$build/bench/peers/peer_$p" "${args[@]}"
+  "$build/bench/peer_$p" "${args[@]}"
 done
-(cd "$results" && for g in *.gp; do gnuplot "$g"; done)
+sections=(timers_arm_cancel timers_rearm timers_fire dispatch_select dispatch_epoll switching
+          shm_one_process shm_two_processes)
+title() { sed -n '1s/^### //p' "$root/bench/text/$1.md"; }
+for s in "${sections[@]}"; do
+  [[ -f "$results/$s.vars" ]] || continue
+  (cd "$results" && gnuplot -e "id='$s'; title='$(title "$s")'" "$root/bench/figure.gp")
+done
 
 if ((quick)); then
   echo "quick run: results in $results (BENCHMARKS.md not rewritten)" >&2
@@ -66,8 +74,6 @@ mkdir -p "$root/docs/bench"
 rm -f "$root/docs/bench"/*.png
 cp "$results"/*.png "$root/docs/bench/"
 
-sections=(timers_arm_cancel timers_rearm timers_fire dispatch_select dispatch_epoll switching
-          shm_one_process shm_two_processes)
 peer_versions=$(dpkg-query -W -f='${Package} ${Version}\n' libevent-dev libev-dev libuv1-dev libboost-dev \
   libboost-context-dev libc6 2>/dev/null | sed 's/^/    /')
 {
@@ -83,15 +89,14 @@ peers: they show what the system calls or the C library alone cost. Samples are 
 thread's CPU-time clock, so time spent descheduled by other load on the machine is not counted;
 the two-process figures are wall-clock, since waiting for the other process is part of them.
 
-Sources: \`bench/peers/\` (one driver per workload, \`harness.h\` for the interleaving, medians,
-tables and plots). The subsystems' own Google Benchmark programs (\`bench/*_bench.cpp\`) are built
-in the same tree and can be run on their own.
+Sources: \`bench/\` (one driver per workload, \`harness.h\` for the interleaving, medians and
+tables, \`figure.gp\` for the plots, \`text/\` for the prose of each section).
 
 ## How to rerun
 
     bash scripts/bench.sh           # builds build/bench (Release), runs everything, rewrites this file
     bash scripts/bench.sh --quick   # smoke run, results in build/bench/results only
-    build/bench/bench/peers/peer_timers --reps=7 --out=/tmp/x   # one driver alone
+    build/bench/bench/peer_timers --reps=7 --out=/tmp/x   # one driver alone
 
 The run took $(( $(date +%s) - start )) s on the machine below. Figures on a shared or loaded
 machine move by 10-20 % from run to run; ratios within one row move much less.
@@ -109,14 +114,15 @@ $peer_versions
 
 EOF
   for s in "${sections[@]}"; do
+    cat "$root/bench/text/$s.md"
+    echo
     if [[ -f "$results/$s.md" ]]; then
-      sed -E 's#\]\(([a-z_]+)\.png\)#](docs/bench/\1.png)#' "$results/$s.md"
+      cat "$results/$s.md"
+      printf '\n![%s](docs/bench/%s.png)\n\n' "$(title "$s")" "$s"
     else
-      printf '### %s\n\nNot measured in this run: its driver did not build.\n\n' "$s"
+      printf 'Not measured in this run: its driver did not build.\n\n'
     fi
   done
-  if [[ -f "$root/bench/peers/analysis.md" ]]; then
-    cat "$root/bench/peers/analysis.md"
-  fi
+  cat "$root/docs/bench/analysis.md"
 } >"$root/BENCHMARKS.md"
 echo "wrote $root/BENCHMARKS.md in $(( $(date +%s) - start )) s" >&2

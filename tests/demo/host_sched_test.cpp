@@ -7,7 +7,7 @@
 #include <string>
 #include <vector>
 
-#include "host_sched.h"
+#include "demo.h"
 #include "selector/sel.h"
 
 namespace {

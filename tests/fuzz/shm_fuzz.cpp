@@ -2,7 +2,7 @@
  * followed by operations (allocate, free, free a pointer that is no block,
  * count); after every operation the lists must equal the reference model's
  * and pass the independent list checks, and every live block keeps its
- * pattern. Built and run by scripts/fuzz-shm.sh. */
+ * pattern. Built and run by the fuzz preset (tests/fuzz/CMakeLists.txt). */
 #include "shm/shm.h"
 #include "shm/shm_model.h" // tests/shm
 

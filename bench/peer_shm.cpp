@@ -107,7 +107,7 @@ struct Workload {
 // --- two processes ---------------------------------------------------------------
 // Each child attaches on its own, keeps half of the live blocks, warms up,
 // waits for the start signal and times `ops` operations; the figure is the
-// slower child's time per operation.
+// slower child's time.
 using Attach = std::function<Heap *()>;
 
 double two_processes(const Attach &attach, uint32_t size, long ops) {
@@ -152,23 +152,8 @@ double two_processes(const Attach &attach, uint32_t size, long ops) {
         }
     }
     for (int fd : {ready[0], ready[1], go[0], go[1], result[0], result[1]}) close(fd);
-    return worst / double(ops);
+    return worst;
 }
-
-struct TwoProcContender {
-    Attach attach;
-    uint32_t size;
-    const Options *o;
-    long ops = 0;
-    double operator()() {
-        if (ops == 0) {
-            long n = 20000;
-            double per = two_processes(attach, size, n);
-            ops = std::max(1000L, long(o->sample_ms * 1e6 * o->scale / per));
-        }
-        return two_processes(attach, size, ops);
-    }
-};
 
 std::string name_of(const char *tag) { return "qorbu_bench_" + std::to_string(getpid()) + "_" + tag; }
 
@@ -209,32 +194,17 @@ int main(int argc, char **argv) {
     BoostHeap bh(&boost_one);
     MallocHeap mh;
     FlockOnly fh;
-    const char *names[] = {"libqorbu", "libqorbu+flock", "Boost.Interprocess", "glibc malloc", "4 flock calls"};
-    Role roles[] = {Role::Ours, Role::Ours, Role::Peer, Role::Floor, Role::Floor};
     Heap *heaps[] = {&q_nolock, &q_lock, &bh, &mh, &fh};
-    constexpr int kOne = 5;
     std::vector<std::unique_ptr<Workload>> ws;
     for (Heap *h : heaps) ws.emplace_back(new Workload(h, kLive, 7));
-
-    Section one{"shm_one_process", "Shared memory: one process",
-                "With 10^4 live blocks of random sizes 16..4096 bytes in the heap, one operation is an "
-                "allocation of the given size and its free (rows with a size), or the free of a random live "
-                "block and the allocation of a random size 16..4096 in its place (mixed). libqorbu: a segment "
-                "with one handle (no descriptor lock) and one with a second read-write handle attached, where "
-                "every operation also takes and releases the `flock` descriptor lock. The last floor is the four "
-                "`flock` calls of a locked pair alone, the part of the locked figure that the locking protocol fixes.",
-                "block size (bytes)", "block size (bytes)", true, {}, {}, {}};
-    for (int i = 0; i < kOne; ++i) one.columns.push_back({names[i], roles[i]});
-
-    std::vector<std::shared_ptr<Timed>> timers;
+    Section one{"shm_one_process", "block size (bytes)", "block size (bytes)", true,
+                {{"libqorbu", Role::Ours}, {"libqorbu+flock", Role::Ours}, {"Boost.Interprocess", Role::Peer},
+                 {"glibc malloc", Role::Floor}, {"4 flock calls", Role::Floor}}, {}, {}};
     auto figure = [&](uint32_t size) {
         std::vector<Contender> cs;
-        for (int i = 0; i < kOne; ++i) {
-            Workload *w = ws[size_t(i)].get();
-
-            auto t = std::make_shared<Timed>(o, [w, size](long ops) { return w->run(size, ops); });
-            timers.push_back(t);
-            cs.push_back({names[i], roles[i], [t] { return (*t)(); }});
+        for (size_t i = 0; i < ws.size(); ++i) {
+            Workload *w = ws[i].get();
+            cs.push_back({one.columns[i].name, timed(o, [w, size](long ops) { w->run(size, ops); })});
         }
         return interleave(o, cs);
     };
@@ -242,20 +212,9 @@ int main(int argc, char **argv) {
     one.add("mixed 16..4096", NAN, "", figure(0));
     fprintf(stderr, "shm: one process done\n");
 
-    Section twop{"shm_two_processes", "Shared memory: two processes",
-                 "Two processes attached to one segment (each with its own handle, so libqorbu takes the "
-                 "descriptor lock as its protocol requires), each with 5000 live blocks, run the operation "
-                 "at the same time; the figure is the slower process's wall-clock time per operation (waits for the "
-                 "other process count), so it also grows with whatever else loads the machine. glibc malloc: "
-                 "two processes with private heaps, for reference. 4 flock calls: the descriptor-lock calls "
-                 "of a locked pair alone, both processes locking the same file.",
-                 "operation", "", false,
-                 {{"libqorbu", Role::Ours},
-                  {"Boost.Interprocess", Role::Peer},
-                  {"glibc malloc", Role::Floor},
-                  {"4 flock calls", Role::Floor}},
-                 {},
-                 {}};
+    Section twop{"shm_two_processes", "operation", "", false,
+                 {{"libqorbu", Role::Ours}, {"Boost.Interprocess", Role::Peer}, {"glibc malloc", Role::Floor},
+                  {"4 flock calls", Role::Floor}}, {}, {}};
     std::string two_name = n_two;
     std::vector<Attach> attach = {
         [two_name]() -> Heap * {
@@ -273,8 +232,9 @@ int main(int argc, char **argv) {
     for (uint32_t size : {0u, 256u}) {
         std::vector<Contender> cs;
         for (size_t i = 0; i < attach.size(); ++i) {
-            auto t = std::make_shared<TwoProcContender>(TwoProcContender{attach[i], size, &o});
-            cs.push_back({twop.columns[i].name, twop.columns[i].role, [t] { return (*t)(); }});
+            Attach at = attach[i];
+            auto sample = [at, size](long ops) { return two_processes(at, size, ops); };
+            cs.push_back({twop.columns[i].name, Calibrated(o, sample, 1000)});
         }
         twop.add(size ? "pair of 256 bytes" : "mixed 16..4096", NAN, "", interleave(o, cs));
     }
@@ -290,10 +250,7 @@ int main(int argc, char **argv) {
     write(o, twop);
 
     for (auto &w : ws) w->release_all();
-    ShmClose(nolock);
-    ShmClose(second);
-    ShmClose(lock);
-    ShmClose(two);
+    for (ShmHandle *h : {nolock, second, lock, two}) ShmClose(h);
     for (auto &n : {n_nolock, n_lock, n_two}) ShmUnlink(n.c_str());
     bip::shared_memory_object::remove(b_one.c_str());
     bip::shared_memory_object::remove(b_two.c_str());

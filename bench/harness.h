@@ -1,8 +1,9 @@
 // Side-by-side comparison harness: runs every contender of a figure in the
 // same process, interleaved (the order rotates from one repetition to the
 // next), repeats each figure and keeps the median. Each driver fills
-// Sections and writes them as a Markdown fragment, a gnuplot data file and a
-// gnuplot script; scripts/bench.sh stitches the fragments into BENCHMARKS.md.
+// Sections and writes each as a Markdown table, gnuplot data and the plot's
+// settings; scripts/bench.sh draws them with bench/figure.gp and stitches the
+// tables, under the prose of bench/text/<id>.md, into BENCHMARKS.md.
 #pragma once
 
 #include <algorithm>
@@ -11,6 +12,7 @@
 #include <cstdlib>
 #include <cstring>
 #include <functional>
+#include <getopt.h>
 #include <string>
 #include <time.h>
 #include <vector>
@@ -46,24 +48,23 @@ struct Options {
     std::string only;             // run only contenders whose name contains this (profiling)
 
     static Options parse(int argc, char **argv) {
+        static const option knobs[] = {{"reps", 1, nullptr, 'r'}, {"sample-ms", 1, nullptr, 'm'},
+                                       {"scale", 1, nullptr, 's'}, {"out", 1, nullptr, 'o'},
+                                       {"clock", 1, nullptr, 'c'}, {"only", 1, nullptr, 'n'}, {}};
         Options o;
-        for (int i = 1; i < argc; ++i) {
-            std::string a = argv[i];
-            auto value = [&](const char *name) -> const char * {
-                size_t n = strlen(name);
-                return a.compare(0, n, name) == 0 ? a.c_str() + n : nullptr;
-            };
-            if (const char *v = value("--reps=")) o.reps = std::max(1, atoi(v));
-            else if (const char *v = value("--sample-ms=")) o.sample_ms = atof(v);
-            else if (const char *v = value("--scale=")) o.scale = atof(v);
-            else if (const char *v = value("--out=")) o.out_dir = v;
-            else if (const char *v = value("--only=")) o.only = v;
-            else if (const char *v = value("--clock=")) sample_clock() = strcmp(v, "wall") == 0 ? CLOCK_MONOTONIC : CLOCK_THREAD_CPUTIME_ID;
-            else {
-                fprintf(stderr, "usage: %s [--reps=N] [--sample-ms=MS] [--scale=F] [--out=DIR] [--clock=cpu|wall] [--only=NAME]\n", argv[0]);
+        for (int c; (c = getopt_long(argc, argv, "", knobs, nullptr)) != -1 || optind < argc;)
+            switch (c) {
+            case 'r': o.reps = std::max(1, atoi(optarg)); break;
+            case 'm': o.sample_ms = atof(optarg); break;
+            case 's': o.scale = atof(optarg); break;
+            case 'o': o.out_dir = optarg; break;
+            case 'c': sample_clock() = strcmp(optarg, "wall") == 0 ? CLOCK_MONOTONIC : CLOCK_THREAD_CPUTIME_ID; break;
+            case 'n': o.only = optarg; break;
+            default:
+                fprintf(stderr, "usage: %s [--reps=N] [--sample-ms=MS] [--scale=F] [--out=DIR] [--clock=cpu|wall] "
+                                "[--only=NAME]\n", argv[0]);
                 exit(2);
             }
-        }
         return o;
     }
 };
@@ -74,7 +75,6 @@ enum class Role { Ours, Peer, Floor };
 // cost of one operation in nanoseconds.
 struct Contender {
     std::string name;
-    Role role;
     std::function<double()> run;
 };
 
@@ -87,8 +87,7 @@ inline double median(std::vector<double> v) {
 
 // Runs reps rounds; in round r the contenders start at index r (rotation), so
 // none is always first after a cold start or always last on a warm cache.
-inline std::vector<double> interleave(const Options &o, std::vector<Contender> &cs,
-                                      std::vector<std::vector<double>> *all = nullptr) {
+inline std::vector<double> interleave(const Options &o, std::vector<Contender> &cs) {
     std::vector<std::vector<double>> samples(cs.size());
     for (int r = 0; r < o.reps; ++r)
         for (size_t k = 0; k < cs.size(); ++k) {
@@ -98,46 +97,46 @@ inline std::vector<double> interleave(const Options &o, std::vector<Contender> &
         }
     std::vector<double> med;
     for (auto &s : samples) med.push_back(median(s));
-    if (all) *all = samples;
     return med;
 }
 
 // Calibrates an operation count once (so that one sample lasts about
-// sample_ms), then times `body(count)` per sample. body returns the number of
-// operations it performed.
-class Timed {
+// sample_ms), then returns the cost of one operation per sample.
+// sample(n) performs n operations and returns the nanoseconds they took.
+class Calibrated {
   public:
-    Timed(const Options &o, std::function<long(long)> body, long min_ops = 16)
-        : opt_(o), body_(std::move(body)), min_ops_(min_ops) {}
+    Calibrated(const Options &o, std::function<double(long)> sample, long min_ops = 16)
+        : opt_(o), sample_(std::move(sample)), min_ops_(min_ops) {}
     double operator()() {
         if (ops_ == 0) calibrate();
-        double t0 = now_ns();
-        long done = body_(ops_);
-        double t1 = now_ns();
-        return (t1 - t0) / double(done);
+        return sample_(ops_) / double(ops_);
     }
 
   private:
     void calibrate() {
-        long n = min_ops_;
-        for (;;) {
-            double t0 = now_ns();
-            long done = body_(n);
-            double dt = now_ns() - t0;
-            double per = dt / double(done);
-            double want = opt_.sample_ms * 1e6 * opt_.scale;
+        double want = opt_.sample_ms * 1e6 * opt_.scale;
+        for (long n = min_ops_;; n *= 4) {
+            double dt = sample_(n);
             if (dt > want / 4 || n > (1L << 40)) {
-                ops_ = std::max(min_ops_, long(want / per));
+                ops_ = std::max(min_ops_, long(double(n) * want / dt));
                 return;
             }
-            n *= 4;
         }
     }
     const Options &opt_;
-    std::function<long(long)> body_;
+    std::function<double(long)> sample_;
     long min_ops_;
     long ops_ = 0;
 };
+
+// The same, timing body(n) on the sample clock.
+inline Calibrated timed(const Options &o, std::function<void(long)> body) {
+    return Calibrated(o, [body](long n) {
+        double t0 = now_ns();
+        body(n);
+        return now_ns() - t0;
+    });
+}
 
 struct Column {
     std::string name;
@@ -153,9 +152,7 @@ struct Row {
 
 // One table (and one plot) of BENCHMARKS.md.
 struct Section {
-    std::string id;       // file stem: <id>.md, <id>.dat, <id>.gp, <id>.png
-    std::string title;
-    std::string what;     // one paragraph: what one operation is
+    std::string id;       // file stem: <id>.md, <id>.dat, <id>.vars, <id>.png
     std::string row_head; // heading of the label column
     std::string xlabel;
     bool logx = false;
@@ -187,9 +184,7 @@ struct Section {
 inline std::string fmt(double ns) {
     char b[64];
     if (std::isnan(ns)) return "n/a";
-    if (ns >= 100000) snprintf(b, sizeof b, "%.0f", ns);
-    else if (ns >= 100) snprintf(b, sizeof b, "%.1f", ns);
-    else snprintf(b, sizeof b, "%.2f", ns);
+    snprintf(b, sizeof b, ns >= 100000 ? "%.0f" : ns >= 100 ? "%.1f" : "%.2f", ns);
     return b;
 }
 
@@ -233,7 +228,6 @@ inline FILE *open_out(const Options &o, const std::string &name) {
 
 inline void write_markdown(const Options &o, const Section &s) {
     FILE *f = open_out(o, s.id + ".md");
-    fprintf(f, "### %s\n\n%s\n\n", s.title.c_str(), s.what.c_str());
     fprintf(f, "Median ns per operation over %d interleaved repetitions; in brackets the ratio to the best "
                "peer of the row.\n\n| %s |",
             o.reps, s.row_head.c_str());
@@ -252,14 +246,10 @@ inline void write_markdown(const Options &o, const Section &s) {
         }
         fprintf(f, " %s |\n", who.empty() ? "-" : who.c_str());
     }
-    bool plotted = std::any_of(s.rows.begin(), s.rows.end(), [](const Row &r) { return !std::isnan(r.x); });
-    fprintf(f, "\n![%s](%s.png)\n", s.title.c_str(), s.id.c_str());
-    (void)plotted;
     if (!s.verdicts.empty()) {
         fprintf(f, "\nTargets:\n\n");
         for (auto &v : s.verdicts) fprintf(f, "- %s\n", v.c_str());
     }
-    fprintf(f, "\n");
     fclose(f);
 }
 
@@ -269,39 +259,30 @@ inline std::string gp_quote(const std::string &s) {
     return q + "\"";
 }
 
-// A line per (contender, series) against x when the rows have abscissae,
-// otherwise grouped bars per row.
+// The plot's data for bench/figure.gp: with abscissae, one block per
+// (series, contender) headed by its title, drawn as lines; without, one row
+// per table row, drawn as grouped bars. <id>.vars holds the plot's settings.
 inline void write_plot(const Options &o, const Section &s) {
     FILE *d = open_out(o, s.id + ".dat");
-    FILE *g = open_out(o, s.id + ".gp");
-    fprintf(g, "set terminal pngcairo size 900,540 noenhanced font ',10'\nset output '%s.png'\n", s.id.c_str());
-    fprintf(g, "set title %s\nset ylabel 'ns per operation (median)'\nset grid\nset key outside right\n",
-            gp_quote(s.title).c_str());
     bool lines = std::any_of(s.rows.begin(), s.rows.end(), [](const Row &r) { return !std::isnan(r.x); });
+    std::string widths, dashes;
+    int blocks = 0;
     if (lines) {
         std::vector<std::string> series;
         for (auto &r : s.rows)
             if (!std::isnan(r.x) && std::find(series.begin(), series.end(), r.series) == series.end())
                 series.push_back(r.series);
-        // one gnuplot data block per (series, contender)
-        int block = 0;
-        std::string plot = "plot ";
         for (auto &se : series)
-            for (size_t c = 0; c < s.columns.size(); ++c) {
-                fprintf(d, "# %s %s\n", s.columns[c].name.c_str(), se.c_str());
+            for (size_t c = 0; c < s.columns.size(); ++c, ++blocks) {
+                fprintf(d, "x %s\n", gp_quote(s.columns[c].name + (se.empty() ? "" : " " + se)).c_str());
                 for (auto &r : s.rows)
                     if (!std::isnan(r.x) && r.series == se && !std::isnan(r.median[c]))
                         fprintf(d, "%g %g\n", r.x, r.median[c]);
                 fprintf(d, "\n\n");
-                std::string title = s.columns[c].name + (se.empty() ? "" : " " + se);
-                const char *style = s.columns[c].role == Role::Ours ? "lw 3" : s.columns[c].role == Role::Floor ? "dt 2 lw 2" : "lw 1.5";
-                plot += (block ? ", " : "") + std::string("'") + s.id + ".dat' index " + std::to_string(block) +
-                        " with linespoints " + style + " title " + gp_quote(title);
-                ++block;
+                Role role = s.columns[c].role;
+                widths += role == Role::Ours ? "3 " : role == Role::Floor ? "2 " : "1.5 ";
+                dashes += role == Role::Floor ? "2 " : "1 ";
             }
-        fprintf(g, "set xlabel %s\n", gp_quote(s.xlabel).c_str());
-        if (s.logx) fprintf(g, "set logscale x\n");
-        fprintf(g, "set logscale y\n%s\n", plot.c_str());
     } else {
         fprintf(d, "row");
         for (auto &c : s.columns) fprintf(d, " %s", gp_quote(c.name).c_str());
@@ -311,23 +292,20 @@ inline void write_plot(const Options &o, const Section &s) {
             for (double m : r.median) fprintf(d, " %g", std::isnan(m) ? 0.0 : m);
             fprintf(d, "\n");
         }
-        fprintf(g, "set style data histograms\nset style histogram cluster gap 1\nset style fill solid 0.8 border -1\n"
-                   "set xtics rotate by -20\nset yrange [0:*]\n");
-        std::string plot = "plot ";
-        for (size_t c = 0; c < s.columns.size(); ++c)
-            plot += (c ? ", " : "") + std::string("'") + s.id + ".dat' using " + std::to_string(c + 2) +
-                    (c ? "" : ":xtic(1)") + " title columnheader";
-        fprintf(g, "%s\n", plot.c_str());
     }
     fclose(d);
-    fclose(g);
+    FILE *v = open_out(o, s.id + ".vars");
+    fprintf(v, "lines = %d; blocks = %d; columns = %zu; logx = %d\nxlabel = %s; widths = %s; dashes = %s\n",
+            lines, blocks, s.columns.size(), s.logx, gp_quote(s.xlabel).c_str(), gp_quote(widths).c_str(),
+            gp_quote(dashes).c_str());
+    fclose(v);
 }
 
 inline void write(const Options &o, const Section &s) {
     write_markdown(o, s);
     write_plot(o, s);
     // echo the table on stdout for whoever runs the driver by hand
-    printf("== %s\n", s.title.c_str());
+    printf("== %s\n", s.id.c_str());
     for (size_t r = 0; r < s.rows.size(); ++r) {
         printf("  %-18s", s.rows[r].label.c_str());
         for (size_t i = 0; i < s.columns.size(); ++i)

@@ -28,19 +28,17 @@ void nothing(void *) {}
 
 // One green thread yielding to the main context, which yields back from
 // greenthreads_run: two switches per yield.
-long qorbu_switches(long ops) {
+void qorbu_switches(long ops) {
     yields_left = ops / 2;
     greenthread_create(yielder, nullptr);
     greenthreads_run();
-    return ops;
 }
 
-long qorbu_create_finish(long ops) {
+void qorbu_create_finish(long ops) {
     for (long k = 0; k < ops; ++k) {
         greenthread_create(nothing, nullptr);
         greenthreads_run();
     }
-    return ops;
 }
 
 // --- bare swapcontext ----------------------------------------------------------
@@ -51,20 +49,19 @@ void bounce() {
     for (;;) swapcontext(&uc_co, &uc_main);
 }
 
-long uc_switches(long ops) {
+void uc_switches(long ops) {
     getcontext(&uc_co);
     uc_co.uc_stack.ss_sp = uc_stack.get();
     uc_co.uc_stack.ss_size = kStack;
     uc_co.uc_link = nullptr;
     makecontext(&uc_co, bounce, 0);
     for (long k = 0; k < ops / 2; ++k) swapcontext(&uc_main, &uc_co);
-    return ops;
 }
 
 void finish_at_once() {}
 
 // makecontext on a reused stack, switch in, return through uc_link.
-long uc_create_finish(long ops) {
+void uc_create_finish(long ops) {
     getcontext(&uc_co);
     for (long k = 0; k < ops; ++k) {
         uc_co.uc_stack.ss_sp = uc_stack.get();
@@ -73,11 +70,10 @@ long uc_create_finish(long ops) {
         makecontext(&uc_co, finish_at_once, 0);
         swapcontext(&uc_main, &uc_co);
     }
-    return ops;
 }
 
 // --- Boost.Context ----------------------------------------------------------------
-long boost_switches(long ops) {
+void boost_switches(long ops) {
     bool stop = false;
     ctx::fiber f{[&stop](ctx::fiber &&main) {
         while (!stop) main = std::move(main).resume();
@@ -86,24 +82,21 @@ long boost_switches(long ops) {
     for (long k = 0; k < ops / 2; ++k) f = std::move(f).resume();
     stop = true;
     f = std::move(f).resume(); // let it return
-    return ops;
 }
 
-long boost_create_finish(long ops) {
+void boost_create_finish(long ops) {
     ctx::pooled_fixedsize_stack pool(kStack);
     for (long k = 0; k < ops; ++k) {
         ctx::fiber f{std::allocator_arg, pool, [](ctx::fiber &&main) { return std::move(main); }};
         f = std::move(f).resume();
     }
-    return ops;
 }
 
 // --- floor: the signal-mask system call a switch that keeps the mask makes ---------
-long mask_calls(long ops, int per_op) {
+void mask_calls(long ops, int per_op) {
     sigset_t current;
     sigprocmask(SIG_BLOCK, nullptr, &current);
     for (long k = 0; k < ops * per_op; ++k) sigprocmask(SIG_SETMASK, &current, nullptr);
-    return ops;
 }
 
 } // namespace
@@ -113,38 +106,17 @@ int main(int argc, char **argv) {
     SelInit();
     greenthreads_init();
 
-    Section s{"switching", "Switching",
-              "switch: one transfer of control between two contexts (a green thread yielding to the main "
-              "context and back; a pair of `swapcontext` calls; a pair of Boost.Context `fiber::resume`). "
-              "create+finish: create a thread and run it until its (empty) entry function has returned: "
-              "`greenthread_create` + `greenthreads_run` (the finished record and stack are reused); "
-              "`makecontext` on a reused stack + `swapcontext` + return through `uc_link`; a Boost.Context "
-              "fiber on a pooled stack resumed once. Bare `swapcontext` and libqorbu save and restore the "
-              "signal mask (one system call per switch); Boost.Context does not. The floor is that system call "
-              "alone: one `sigprocmask` per switch, two per create+finish (two switches).",
-              "operation", "", false,
-              {{"libqorbu", Role::Ours},
-               {"swapcontext", Role::Peer},
-               {"Boost.Context", Role::Peer},
-               {"sigprocmask", Role::Floor}},
-              {},
-              {}};
-
-    Timed q_sw(o, qorbu_switches), u_sw(o, uc_switches), b_sw(o, boost_switches);
-    Timed f_sw(o, [](long ops) { return mask_calls(ops, 1); });
-    std::vector<Contender> sw = {{"libqorbu", Role::Ours, [&] { return q_sw(); }},
-                                 {"swapcontext", Role::Peer, [&] { return u_sw(); }},
-                                 {"Boost.Context", Role::Peer, [&] { return b_sw(); }},
-                                 {"sigprocmask", Role::Floor, [&] { return f_sw(); }}};
-    s.add("switch", NAN, "", interleave(o, sw));
-
-    Timed q_cf(o, qorbu_create_finish), u_cf(o, uc_create_finish), b_cf(o, boost_create_finish);
-    Timed f_cf(o, [](long ops) { return mask_calls(ops, 2); });
-    std::vector<Contender> cf = {{"libqorbu", Role::Ours, [&] { return q_cf(); }},
-                                 {"swapcontext", Role::Peer, [&] { return u_cf(); }},
-                                 {"Boost.Context", Role::Peer, [&] { return b_cf(); }},
-                                 {"sigprocmask", Role::Floor, [&] { return f_cf(); }}};
-    s.add("create+finish", NAN, "", interleave(o, cf));
+    Section s{"switching", "operation", "", false,
+              {{"libqorbu", Role::Ours}, {"swapcontext", Role::Peer}, {"Boost.Context", Role::Peer},
+               {"sigprocmask", Role::Floor}}, {}, {}};
+    auto row = [&](const char *label, std::vector<void (*)(long)> bodies) {
+        std::vector<Contender> cs;
+        for (size_t i = 0; i < bodies.size(); ++i) cs.push_back({s.columns[i].name, timed(o, bodies[i])});
+        s.add(label, NAN, "", interleave(o, cs));
+    };
+    row("switch", {qorbu_switches, uc_switches, boost_switches, [](long ops) { mask_calls(ops, 1); }});
+    row("create+finish",
+        {qorbu_create_finish, uc_create_finish, boost_create_finish, [](long ops) { mask_calls(ops, 2); }});
 
     s.verdicts.push_back(check(s, "a green-thread switch at most 1.1x a bare swapcontext", "libqorbu",
                                [&](size_t r) { return s.at(r, "swapcontext"); }, 1.1,

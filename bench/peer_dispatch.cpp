@@ -10,7 +10,7 @@
 #include <sys/resource.h>
 #include <unistd.h>
 
-#include "chain.h"
+#include "loops.h"
 #include "selector/sel.h"
 
 using namespace bench;
@@ -108,29 +108,6 @@ double run_sample(int n, int a, const MakeLoop &make, long events) {
     return now_ns() - t0;
 }
 
-// Calibrates the number of events once per contender and configuration.
-struct DispatchContender {
-    int n, a;
-    MakeLoop make;
-    const Options *o;
-    long events = 0;
-    double operator()() {
-        if (events == 0) {
-            long e = 1000;
-            for (;;) {
-                double dt = run_sample(n, a, make, e);
-                double want = o->sample_ms * 1e6 * o->scale;
-                if (dt > want / 4) {
-                    events = std::max(long(a) * 4, long(double(e) * want / dt));
-                    break;
-                }
-                e *= 4;
-            }
-        }
-        return run_sample(n, a, make, events) / double(events);
-    }
-};
-
 } // namespace
 
 int main(int argc, char **argv) {
@@ -162,19 +139,8 @@ int main(int argc, char **argv) {
         {"read+write", 2, Role::Floor, nullptr},
     };
 
-    const char *what = "N pipes with A bytes circulating; each read callback reads one byte and writes one into the "
-                       "next pipe; one operation = one callback with its read and write. Every loop is driven "
-                       "one pass at a time (%s). The floor is the same read+write pair with no loop at all. "
-                       "Each sample creates its pipes and loop afresh, outside the timed part.";
-    char what_sel[600], what_ep[600];
-    snprintf(what_sel, sizeof what_sel, what,
-             "`SelSelect`, `event_base_loop(EVLOOP_ONCE)` with the select backend, `ev_run(EVRUN_ONCE)` with "
-             "`EVBACKEND_SELECT`");
-    snprintf(what_ep, sizeof what_ep, what,
-             "`SelEpoll` after `SelUseEpoll`, libevent's epoll backend, libev's `EVBACKEND_EPOLL`, "
-             "`uv_run(UV_RUN_ONCE)` with `uv_poll_t` watchers");
-    Section sel{"dispatch_select", "Dispatch: select mode", what_sel, "pipes N, active A", "pipes N", true, {}, {}, {}};
-    Section ep{"dispatch_epoll", "Dispatch: epoll mode", what_ep, "pipes N, active A", "pipes N", true, {}, {}, {}};
+    Section sel{"dispatch_select", "pipes N, active A", "pipes N", true, {}, {}, {}};
+    Section ep{"dispatch_epoll", "pipes N, active A", "pipes N", true, {}, {}, {}};
     for (auto &e : entries) {
         if (e.section != 1) sel.columns.push_back({e.name, e.role});
         if (e.section != 0) ep.columns.push_back({e.name, e.role});
@@ -183,13 +149,12 @@ int main(int argc, char **argv) {
     for (int a : {1, 100})
         for (int n : {100, 1000}) {
             std::vector<Contender> cs;
-            std::vector<std::shared_ptr<DispatchContender>> dc;
             std::string label = "N=" + std::to_string(n) + ", A=" + std::to_string(a);
             for (auto &e : entries) {
-                auto d = std::make_shared<DispatchContender>(DispatchContender{n, a, e.make, &o});
                 // e.g. "libqorbu/select N=100, A=1", for --only
-                std::string key = std::string(e.name) + (e.section == 0 ? "/select " : e.section == 1 ? "/epoll " : " ") + label;
-                cs.push_back({key, e.role, [d] { return (*d)(); }});
+                const char *mode = e.section == 0 ? "/select " : e.section == 1 ? "/epoll " : " ";
+                auto sample = [n, a, make = e.make](long events) { return run_sample(n, a, make, events); };
+                cs.push_back({e.name + std::string(mode) + label, Calibrated(o, sample, 1000)});
             }
             std::vector<double> med = interleave(o, cs);
             std::vector<double> ms, me;
@@ -205,9 +170,7 @@ int main(int argc, char **argv) {
 
     auto best = [](const Section &s) { return [&s](size_t r) { return s.best_peer(r); }; };
     auto floor = [](const Section &s) { return [&s](size_t r) { return s.at(r, "read+write"); }; };
-    auto a100 = [](const Section &s) {
-        return [&s](size_t r) { return s.rows[r].series == "A=100"; };
-    };
+    auto a100 = [](const Section &s) { return [&s](size_t r) { return s.rows[r].series == "A=100"; }; };
     sel.verdicts.push_back(check(sel, "select mode at most the best select backend at every N and A", "libqorbu",
                                  best(sel), 1.0));
     sel.verdicts.push_back(check(sel, "A=100 within 2x of the read+write floor", "libqorbu", floor(sel), 2.0, a100(sel)));
