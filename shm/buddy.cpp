@@ -1,5 +1,6 @@
 /* Buddy allocation of a segment's data area: 27 power-of-two size classes,
  * split on demand and merged back with free partners. */
+#include "shm/shm_inspect_private.h"
 #include "shm/shm_private.h"
 
 #include <algorithm>
@@ -26,11 +27,7 @@ constexpr char kDoubleFreeMessage[] = "ShmFree(): double-free\n";
 
 uintptr_t &nextOf(uintptr_t block) { return *reinterpret_cast<uintptr_t *>(block); }
 
-uintptr_t popHead(ShmHeader *h, int k) {
-    const uintptr_t block = h->freeList[k];
-    h->freeList[k] = nextOf(block);
-    return block;
-}
+DataArea areaOf(const ShmHandle *h) { return dataAreaOf(h->base, h->size, pageSize()); }
 
 int firstNonEmptyFrom(const ShmHeader *h, int k) {
     for (int j = k; j < kClassCount; j++) {
@@ -40,9 +37,14 @@ int firstNonEmptyFrom(const ShmHeader *h, int k) {
 }
 
 /* Takes the highest block of class j and splits it down to class k: the
- * upper halves become the only members of the (empty) lists in between. */
-uintptr_t takeAndSplit(ShmHeader *h, int j, int k) {
-    const uintptr_t block = popHead(h, j);
+ * upper halves become the only members of the (empty) lists in between.
+ * 0 when list j is damaged; nothing has changed then. */
+uintptr_t takeAndSplit(ShmHeader *h, const DataArea &area, int j, int k) {
+    ListCursor cursor(h, area, j);
+    const uintptr_t block = cursor.entry();
+    if (block != 0) cursor.advance();
+    if (cursor.damaged()) return 0;
+    h->freeList[j] = cursor.entry();
     for (int i = j - 1; i >= k; i--) {
         const uintptr_t upper = block + blockSize(i);
         nextOf(upper) = 0;
@@ -57,21 +59,6 @@ int classNamedBy(const ShmHeader *h, uintptr_t word) {
     if (word < first || (word - first) % sizeof(uintptr_t) != 0) return -1;
     const uintptr_t k = (word - first) / sizeof(uintptr_t);
     return k < static_cast<uintptr_t>(kClassCount) ? static_cast<int>(k) : -1;
-}
-
-/* Whether p can be a block that ShmAlloc handed out through this handle:
- * inside its data area, and with a class word that names a freeList slot
- * of its header and a block that fits the segment. Reads nothing outside
- * the handle's mapping. */
-bool ownsBlock(const ShmHandle *handle, uintptr_t p) {
-    const uintptr_t base = reinterpret_cast<uintptr_t>(handle->base);
-    const uintptr_t page = pageSize();
-    const uintptr_t end = base + handle->size;
-    if (p < base + page || p >= end || p % kSmallestBlock != 0) return false;
-    const uintptr_t word = *classWordOf(p);
-    if ((word & ~(page - 1)) != base) return false;
-    const int k = classNamedBy(handle->base, word);
-    return k >= 0 && blockSize(k) <= end - p;
 }
 
 void reportMismatch() {
@@ -93,37 +80,45 @@ struct ListPosition {
     uintptr_t *upperLink;  // the link that leads to the upper neighbour
     uintptr_t upper;       // 0 when none
     uintptr_t lower;       // 0 when none
+    bool damaged;
 };
 
-ListPosition findPosition(ShmHeader *h, int k, uintptr_t p) {
-    ListPosition pos{&h->freeList[k], nullptr, 0, 0};
-    while (*pos.link != 0 && *pos.link > p) {
-        pos.upperLink = pos.link;
-        pos.upper = *pos.link;
-        pos.link = &nextOf(pos.upper);
+ListPosition findPosition(ShmHeader *h, const DataArea &area, int k, uintptr_t p) {
+    ListCursor cursor(h, area, k);
+    ListPosition pos{cursor.link(), nullptr, 0, 0, false};
+    while (cursor.entry() > p) {
+        pos.upperLink = cursor.link();
+        pos.upper = cursor.entry();
+        cursor.advance();
     }
-    pos.lower = *pos.link;
+    pos.link = cursor.link();
+    pos.lower = cursor.entry();
+    pos.damaged = cursor.damaged();
     return pos;
 }
 
 /* Inserts p in its class's list and merges it upward while its partner is
- * free; ends the process when p is already free. */
-void insertAndMerge(ShmHeader *h, uintptr_t p, SegmentLock &lock) {
+ * free; ends the process when p is already free. Returns 0, or kDamaged
+ * when a list on the way is damaged (p, or what it merged into, is then
+ * in no list). */
+int insertAndMerge(ShmHeader *h, const DataArea &area, uintptr_t p, SegmentLock &lock) {
     for (;;) {
-        const int k = classNamedBy(h, *classWordOf(p));
-        const ListPosition pos = findPosition(h, k, p);
+        const int k = blockClass(h, area, p);
+        if (k < 0) return kDamaged;
+        const ListPosition pos = findPosition(h, area, k, p);
+        if (pos.damaged) return kDamaged;
         if (pos.lower == p) endOnDoubleFree(lock);
         nextOf(p) = pos.lower;
         *pos.link = p;
-        if (k == kLargestClass) return;
+        if (k == kLargestClass) return 0;
         const uintptr_t size = blockSize(k);
         if (p % (2 * size) != 0) {
-            if (pos.lower == 0 || pos.lower != p - size) return;
+            if (pos.lower == 0 || pos.lower != p - size) return 0;
             *pos.link = nextOf(pos.lower);
             *classWordOf(pos.lower) = classWordFor(h, k + 1);
             p = pos.lower;
         } else {
-            if (pos.upper == 0 || pos.upper != p + size) return;
+            if (pos.upper == 0 || pos.upper != p + size) return 0;
             *pos.upperLink = pos.lower;
             *classWordOf(p) = classWordFor(h, k + 1);
         }
@@ -131,6 +126,12 @@ void insertAndMerge(ShmHeader *h, uintptr_t p, SegmentLock &lock) {
 }
 
 } // namespace
+
+int blockClass(const ShmHeader *h, const DataArea &area, uintptr_t p) {
+    if (p - area.start >= area.length || p % kSmallestBlock != 0) return -1;
+    const int k = classNamedBy(h, *classWordOf(p));
+    return k >= 0 && blockFits(area, k, p) ? k : -1;
+}
 
 } // namespace qorbu::shm
 
@@ -152,13 +153,12 @@ QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
     lock.markBusy();
     ShmHeader *header = h->base;
     const int j = firstNonEmptyFrom(header, k);
-    if (j < 0) {
-        lock.release();
-        errno = ENOMEM;
+    const uintptr_t block = j < 0 ? 0 : takeAndSplit(header, areaOf(h), j, k);
+    lock.release();
+    if (block == 0) {
+        errno = j < 0 ? ENOMEM : kDamaged;
         return nullptr;
     }
-    const uintptr_t block = takeAndSplit(header, j, k);
-    lock.release();
     *classWordOf(block) = classWordFor(header, k);
     return reinterpret_cast<void *>(block);
 }
@@ -166,7 +166,9 @@ QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
 QORBU_API void ShmFree(ShmHandle *h, void *p) {
     if (p == nullptr) return;
     const uintptr_t block = reinterpret_cast<uintptr_t>(p);
-    if (!ownsBlock(h, block)) {
+    const DataArea area = areaOf(h);
+    // The word below p is read before the lock only if p lies in the data area.
+    if (blockClass(h->base, area, block) < 0) {
         reportMismatch();
         return;
     }
@@ -175,8 +177,17 @@ QORBU_API void ShmFree(ShmHandle *h, void *p) {
         errno = err;
         return;
     }
+    // Another thread may have overwritten the class word meanwhile.
+    if (blockClass(h->base, area, block) < 0) {
+        lock.release();
+        reportMismatch();
+        return;
+    }
     lock.markBusy();
-    insertAndMerge(h->base, block, lock);
+    if (int err = insertAndMerge(h->base, area, block, lock)) {
+        lock.release();
+        errno = err;
+    }
 }
 
 QORBU_API uint32_t ShmTotalFree(ShmHandle *h) {
@@ -185,23 +196,64 @@ QORBU_API uint32_t ShmTotalFree(ShmHandle *h) {
         errno = err;
         return 0;
     }
+    const DataArea area = areaOf(h);
     uint32_t total = 0;
     for (int k = 0; k < kClassCount; k++) {
-        for (uintptr_t e = h->base->freeList[k]; e != 0; e = nextOf(e)) {
-            total += static_cast<uint32_t>(blockSize(k));
+        ListCursor cursor(h->base, area, k);
+        for (; cursor.entry() != 0; cursor.advance()) total += static_cast<uint32_t>(blockSize(k));
+        if (cursor.damaged()) {
+            lock.release();
+            errno = kDamaged;
+            return 0;
         }
     }
     return total;
 }
 
 QORBU_API void ShmPrintFree(FILE *stream, ShmHeader *header) {
+    // The lists are checked against the process's own mapping of the segment.
+    const uint32_t length = mappedLength(header);
+    const uintptr_t page = pageSize();
+    bool damaged = length == 0;
     for (int k = 0; k < kClassCount; k++) {
         fprintf(stream, "0x%08x [%d] = { ", static_cast<unsigned>(blockSize(k)), k);
-        for (uintptr_t e = header->freeList[k]; e != 0; e = nextOf(e)) {
-            fprintf(stream, "%p%s ", reinterpret_cast<void *>(e), nextOf(e) != 0 ? "," : "");
+        if (length != 0) {
+            ListCursor cursor(header, dataAreaOf(header, length, page), k);
+            while (cursor.entry() != 0) {
+                const uintptr_t e = cursor.entry();
+                cursor.advance();
+                fprintf(stream, "%p%s ", reinterpret_cast<void *>(e), cursor.entry() != 0 ? "," : "");
+            }
+            damaged = damaged || cursor.damaged();
         }
         fputs("}\n", stream);
     }
+    if (damaged) errno = kDamaged;
+}
+
+__attribute__((visibility("hidden"))) int qorbuShmSummarise(const ShmHandle *h, ShmFreeSummary *summary) {
+    *summary = ShmFreeSummary{0, 0, 0};
+    const DataArea area = areaOf(h);
+    for (int k = 0; k < kClassCount; k++) {
+        ListCursor cursor(h->base, area, k);
+        for (; cursor.entry() != 0; cursor.advance()) {
+            summary->freeBytes += static_cast<uint32_t>(blockSize(k));
+            summary->blocks++;
+            summary->largest = static_cast<uint32_t>(blockSize(k));
+        }
+        if (cursor.damaged()) return kDamaged;
+    }
+    return 0;
+}
+
+__attribute__((visibility("hidden"))) ShmBlockState qorbuShmBlockState(const ShmHandle *h, const void *p) {
+    const uintptr_t block = reinterpret_cast<uintptr_t>(p);
+    const DataArea area = areaOf(h);
+    const int k = blockClass(h->base, area, block);
+    if (k < 0) return SHM_BLOCK_FOREIGN;
+    const ListPosition pos = findPosition(h->base, area, k, block);
+    if (pos.damaged) return SHM_BLOCK_DAMAGED;
+    return pos.lower == block ? SHM_BLOCK_FREE : SHM_BLOCK_ALLOCATED;
 }
 
 } // extern "C"

@@ -5,6 +5,7 @@
 #include "shm/shm.h"
 
 #include <atomic>
+#include <cerrno>
 #include <cstddef>
 #include <cstdint>
 #include <sys/types.h>
@@ -16,10 +17,12 @@ constexpr int kLargestClass = kClassCount - 1;
 constexpr uintptr_t kSmallestBlock = 8;
 constexpr uintptr_t kAddressAlignment = 4096;  // data addresses given to ShmCreate
 constexpr uint32_t kAllocLimit = 0x40000000u;   // ShmAlloc refuses n at or above this
-constexpr unsigned kPublishPollSeconds = 1;
+constexpr int kPublishWaitMillis = 3000;        // an attach gives up on an unpublished segment after this
+constexpr unsigned kPublishPollMicros = 10000;
 constexpr int kReadOnlyBusyPolls = 1000;        // a read-only attach waits this many ms for busy
 constexpr unsigned kReadOnlyBusyPollMicros = 1000;
 constexpr uintptr_t kClassWordSize = sizeof(uintptr_t);
+constexpr int kDamaged = EUCLEAN;              // errno of an operation that met damaged lists
 
 constexpr uintptr_t blockSize(int k) { return kSmallestBlock << k; }
 
@@ -66,8 +69,16 @@ inline void storeWord(uint32_t &word, uint32_t value) {
  * an errno value with nothing acquired. */
 int attachMapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t length);
 
-/* Drops the handle's reference; the last one unmaps the segment. */
+/* Drops the handle's reference; the last one unmaps the segment, and the
+ * last read-write one turns the mapping back to read-only. */
 void detachMapping(ShmHandle *h);
+
+/* The length of this process's mapping whose header lies at `base`, or 0. */
+uint32_t mappedLength(const void *base);
+
+/* The mmap that turns a read-only mapping read-write in place (tests put a
+ * failing one here). */
+extern void *(*upgradeMap)(void *, size_t, int, int, int, off_t);
 
 /* --- the segment lock (lock.cpp) ------------------------------------------ */
 
@@ -120,6 +131,71 @@ void divideDataArea(ShmHeader *h, uint32_t length);
 
 /* Smallest class whose blocks hold n bytes plus the class word, or -1. */
 int classFor(uint32_t n);
+
+/* The data area as this process maps it: every link is checked against it,
+ * never against what the (possibly damaged) header says. */
+struct DataArea {
+    uintptr_t start;
+    uintptr_t length;
+    uintptr_t page;
+};
+inline DataArea dataAreaOf(const void *header, uint32_t mappingLength, uintptr_t page) {
+    return {reinterpret_cast<uintptr_t>(header) + page, mappingLength - page, page};
+}
+
+/* Whether a block of class k may lie at `block`: wholly inside the data
+ * area and aligned to its size (to the page for blocks above one page,
+ * which is all that a data area at a page-aligned address guarantees). */
+inline bool blockFits(const DataArea &area, int k, uintptr_t block) {
+    const uintptr_t size = blockSize(k);
+    const uintptr_t align = size < area.page ? size : area.page;
+    return size <= area.length && block - area.start <= area.length - size && (block & (align - 1)) == 0;
+}
+
+/* The one walk over a free list. Every entry is checked before it is
+ * followed: a sound block of the class, strictly below the one before it,
+ * and no more entries than the data area can hold. On damage the cursor
+ * stops (entry() 0) with damaged() set. */
+class ListCursor {
+  public:
+    ListCursor(ShmHeader *h, const DataArea &area, int k)
+        : area_(area), link_(&h->freeList[k]), k_(k), left_(area.length / blockSize(k)) {
+        check();
+    }
+    uintptr_t entry() const { return entry_; }
+    /* The link that leads to entry(): the list head or the previous entry's first word. */
+    uintptr_t *link() const { return link_; }
+    bool damaged() const { return damaged_; }
+    void advance() {
+        link_ = reinterpret_cast<uintptr_t *>(entry_);
+        check();
+    }
+
+  private:
+    void check() {
+        const uintptr_t next = *link_;
+        if (next == 0) {
+            entry_ = 0;
+        } else if (next < entry_ && left_-- > 0 && blockFits(area_, k_, next)) {
+            entry_ = next;
+        } else {
+            entry_ = 0;
+            damaged_ = true;
+        }
+    }
+
+    DataArea area_;
+    uintptr_t *link_;
+    uintptr_t entry_ = UINTPTR_MAX;  // the first entry may lie anywhere below
+    int k_;
+    uintptr_t left_;
+    bool damaged_ = false;
+};
+
+/* Whether p can be a block that ShmAlloc handed out in this data area: a
+ * sound block of the class that the class word below it names. The class,
+ * or -1. */
+int blockClass(const ShmHeader *h, const DataArea &area, uintptr_t p);
 
 /* The class word below a block and what it names. */
 inline uintptr_t *classWordOf(uintptr_t block) {
