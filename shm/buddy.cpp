@@ -53,14 +53,6 @@ uintptr_t takeAndSplit(ShmHeader *h, const DataArea &area, int j, int k) {
     return block;
 }
 
-/* The class whose freeList slot the word names, or -1 for any other word. */
-int classNamedBy(const ShmHeader *h, uintptr_t word) {
-    const uintptr_t first = classWordFor(h, 0);
-    if (word < first || (word - first) % sizeof(uintptr_t) != 0) return -1;
-    const uintptr_t k = (word - first) / sizeof(uintptr_t);
-    return k < static_cast<uintptr_t>(kClassCount) ? static_cast<int>(k) : -1;
-}
-
 void reportMismatch() {
     const int saved = errno;
     fputs(kMismatchMessage, stderr);
@@ -97,14 +89,13 @@ ListPosition findPosition(ShmHeader *h, const DataArea &area, int k, uintptr_t p
     return pos;
 }
 
-/* Inserts p in its class's list and merges it upward while its partner is
- * free; ends the process when p is already free. Returns 0, or kDamaged
- * when a list on the way is damaged (p, or what it merged into, is then
- * in no list). */
-int insertAndMerge(ShmHeader *h, const DataArea &area, uintptr_t p, SegmentLock &lock) {
-    for (;;) {
-        const int k = blockClass(h, area, p);
-        if (k < 0) return kDamaged;
+/* Inserts p, of class k, in its list and merges it upward while its
+ * partner is free; ends the process when p is already free. Each merge
+ * writes the merged block's class word, which names the next class.
+ * Returns 0, or kDamaged when a list on the way is damaged (p, or what it
+ * merged into, is then in no list). */
+int insertAndMerge(ShmHeader *h, const DataArea &area, uintptr_t p, int k, SegmentLock &lock) {
+    for (;; k++) {
         const ListPosition pos = findPosition(h, area, k, p);
         if (pos.damaged) return kDamaged;
         if (pos.lower == p) endOnDoubleFree(lock);
@@ -126,12 +117,6 @@ int insertAndMerge(ShmHeader *h, const DataArea &area, uintptr_t p, SegmentLock 
 }
 
 } // namespace
-
-int blockClass(const ShmHeader *h, const DataArea &area, uintptr_t p) {
-    if (p - area.start >= area.length || p % kSmallestBlock != 0) return -1;
-    const int k = classNamedBy(h, *classWordOf(p));
-    return k >= 0 && blockFits(area, k, p) ? k : -1;
-}
 
 } // namespace qorbu::shm
 
@@ -178,13 +163,14 @@ QORBU_API void ShmFree(ShmHandle *h, void *p) {
         return;
     }
     // Another thread may have overwritten the class word meanwhile.
-    if (blockClass(h->base, area, block) < 0) {
+    const int k = blockClass(h->base, area, block);
+    if (k < 0) {
         lock.release();
         reportMismatch();
         return;
     }
     lock.markBusy();
-    if (int err = insertAndMerge(h->base, area, block, lock)) {
+    if (int err = insertAndMerge(h->base, area, block, k, lock)) {
         lock.release();
         errno = err;
     }

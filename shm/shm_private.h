@@ -132,6 +132,14 @@ void divideDataArea(ShmHeader *h, uint32_t length);
 /* Smallest class whose blocks hold n bytes plus the class word, or -1. */
 int classFor(uint32_t n);
 
+/* The class word below a block and what it names. */
+inline uintptr_t *classWordOf(uintptr_t block) {
+    return reinterpret_cast<uintptr_t *>(block - kClassWordSize);
+}
+inline uintptr_t classWordFor(const ShmHeader *h, int k) {
+    return reinterpret_cast<uintptr_t>(&h->freeList[k]);
+}
+
 /* The data area as this process maps it: every link is checked against it,
  * never against what the (possibly damaged) header says. */
 struct DataArea {
@@ -159,7 +167,10 @@ inline bool blockFits(const DataArea &area, int k, uintptr_t block) {
 class ListCursor {
   public:
     ListCursor(ShmHeader *h, const DataArea &area, int k)
-        : area_(area), link_(&h->freeList[k]), k_(k), left_(area.length / blockSize(k)) {
+        : link_(&h->freeList[k]), start_(area.start),
+          bound_(blockSize(k) <= area.length ? area.length - blockSize(k) + 1 : 0),
+          mask_((blockSize(k) < area.page ? blockSize(k) : area.page) - 1),
+          left_(area.length / blockSize(k)) {
         check();
     }
     uintptr_t entry() const { return entry_; }
@@ -174,35 +185,36 @@ class ListCursor {
   private:
     void check() {
         const uintptr_t next = *link_;
+        const uintptr_t offset = next - start_;
         if (next == 0) {
             entry_ = 0;
-        } else if (next < entry_ && left_-- > 0 && blockFits(area_, k_, next)) {
+        } else if (offset < bound_ && (next & mask_) == 0 && left_-- > 0) {
             entry_ = next;
+            bound_ = offset; // strictly descending
         } else {
             entry_ = 0;
             damaged_ = true;
         }
     }
 
-    DataArea area_;
     uintptr_t *link_;
-    uintptr_t entry_ = UINTPTR_MAX;  // the first entry may lie anywhere below
-    int k_;
-    uintptr_t left_;
+    uintptr_t entry_ = 0;
+    uintptr_t start_;
+    uintptr_t bound_;  // the next entry's offset in the data area lies below this
+    uintptr_t mask_;
+    uintptr_t left_;   // entries the data area can still hold
     bool damaged_ = false;
 };
 
 /* Whether p can be a block that ShmAlloc handed out in this data area: a
  * sound block of the class that the class word below it names. The class,
  * or -1. */
-int blockClass(const ShmHeader *h, const DataArea &area, uintptr_t p);
-
-/* The class word below a block and what it names. */
-inline uintptr_t *classWordOf(uintptr_t block) {
-    return reinterpret_cast<uintptr_t *>(block - kClassWordSize);
-}
-inline uintptr_t classWordFor(const ShmHeader *h, int k) {
-    return reinterpret_cast<uintptr_t>(&h->freeList[k]);
+inline int blockClass(const ShmHeader *h, const DataArea &area, uintptr_t p) {
+    if (p - area.start >= area.length || p % kSmallestBlock != 0) return -1;
+    const uintptr_t slot = *classWordOf(p) - classWordFor(h, 0);
+    if (slot >= kClassCount * sizeof(uintptr_t) || slot % sizeof(uintptr_t) != 0) return -1;
+    const int k = static_cast<int>(slot / sizeof(uintptr_t));
+    return blockFits(area, k, p) ? k : -1;
 }
 
 } // namespace qorbu::shm
