@@ -105,9 +105,9 @@ class Deadline {
     bool waitAgain() const {
         struct timespec now;
         clock_gettime(CLOCK_MONOTONIC, &now);
-        const long long elapsed =
-            (now.tv_sec - start_.tv_sec) * 1000LL + (now.tv_nsec - start_.tv_nsec) / 1000000;
-        if (elapsed >= kPublishWaitMillis) return false;
+        const long long elapsedNanos =
+            (now.tv_sec - start_.tv_sec) * 1000000000LL + (now.tv_nsec - start_.tv_nsec);
+        if (elapsedNanos >= kPublishWaitMillis * 1000000LL) return false;
         usleep(kPublishPollMicros);
         return true;
     }
