@@ -152,19 +152,20 @@ QORBU_API void ShmFree(ShmHandle *h, void *p) {
     if (p == nullptr) return;
     const uintptr_t block = reinterpret_cast<uintptr_t>(p);
     const DataArea area = areaOf(h);
-    // The word below p is read before the lock only if p lies in the data area.
-    if (blockClass(h->base, area, block) < 0) {
+    // The word below p is read only once p is known to lie in the data area.
+    const int k = blockClass(h->base, area, block);
+    if (k < 0) {
         reportMismatch();
         return;
     }
+    const uintptr_t word = *classWordOf(block);
     SegmentLock lock(h);
     if (int err = lock.error()) {
         errno = err;
         return;
     }
     // Another thread may have overwritten the class word meanwhile.
-    const int k = blockClass(h->base, area, block);
-    if (k < 0) {
+    if (*classWordOf(block) != word) {
         lock.release();
         reportMismatch();
         return;

@@ -126,7 +126,8 @@ int waitForLength(int fd, struct stat *st, const Deadline &deadline) {
         if (!deadline.waitAgain()) return ETIMEDOUT;
     }
     const auto page = static_cast<off_t>(pageSize());
-    return st->st_size % page == 0 && st->st_size >= 2 * page && st->st_size <= off_t{UINT32_MAX} ? 0 : EINVAL;
+    const auto length = static_cast<unsigned long long>(st->st_size);
+    return st->st_size % page == 0 && st->st_size >= 2 * page && length <= UINT32_MAX ? 0 : EINVAL;
 }
 
 /* Waits, through a read-only view of the first page, until the creator has

@@ -25,6 +25,7 @@ constexpr uintptr_t kClassWordSize = sizeof(uintptr_t);
 constexpr int kDamaged = EUCLEAN;              // errno of an operation that met damaged lists
 
 constexpr uintptr_t blockSize(int k) { return kSmallestBlock << k; }
+static_assert(kSmallestBlock == uintptr_t{1} << 3);
 
 #if UINTPTR_MAX == 0xffffffffu
 static_assert(offsetof(ShmHeader, base) == 0);
@@ -170,7 +171,7 @@ class ListCursor {
         : link_(&h->freeList[k]), start_(area.start),
           bound_(blockSize(k) <= area.length ? area.length - blockSize(k) + 1 : 0),
           mask_((blockSize(k) < area.page ? blockSize(k) : area.page) - 1),
-          left_(area.length / blockSize(k)) {
+          left_(area.length >> (k + 3)) {  // length / blockSize(k)
         check();
     }
     uintptr_t entry() const { return entry_; }

@@ -169,9 +169,9 @@ static int peek_header(const char *name, Peek *peek)
     peek->busy = header->busy;
     munmap((void *)header, (size_t)page);
     if (peek->size == 0)
-        return not_published(name, "an object of its length whose creator is still initialising it, or died first");
-    if (peek->base == 0 || peek->base % (uintptr_t)page != 0 || peek->size % page != 0 ||
-        peek->size < 2 * page || (off_t)peek->size > st.st_size)
+        return not_published(name, "its creator is still initialising it, or died first");
+    if (peek->base == 0 || peek->base % (uintptr_t)page != 0 || peek->size % (uint32_t)page != 0 ||
+        peek->size < 2 * (uint32_t)page || (off_t)peek->size > st.st_size)
         return fail(EXIT_FAILED, "segment '%s' has a damaged header (base %#" PRIxPTR ", size %" PRIu32 ")", name,
                     peek->base, peek->size);
     return EXIT_OK;
