@@ -154,7 +154,7 @@ static int peek_header(const char *name, Peek *peek)
         return not_published(name, "its creator has not sized it, or died first");
     }
     /* A creator sizes the object to whole pages, header and data, at once. */
-    if (st.st_size % page != 0 || st.st_size < 2 * page || st.st_size > (off_t)UINT32_MAX) {
+    if (st.st_size % page != 0 || st.st_size < 2 * page || (unsigned long long)st.st_size > UINT32_MAX) {
         close(fd);
         return fail(EXIT_FAILED, "segment '%s' is damaged: an object of %lld bytes is no segment", name,
                     (long long)st.st_size);
