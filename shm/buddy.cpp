@@ -4,6 +4,7 @@
 #include "shm/shm_private.h"
 
 #include <algorithm>
+#include <bit>
 #include <cerrno>
 #include <cstdlib>
 
@@ -14,10 +15,8 @@ int classFor(uint32_t n) {
     // of the block above it: on 64-bit targets an 8-byte block cannot hold
     // both, so requests start at class 1 there.
     const uint64_t needed = std::max<uint64_t>(uint64_t{n} + kClassWordSize, 2 * kClassWordSize);
-    for (int k = 0; k < kClassCount; k++) {
-        if (needed <= blockSize(k)) return k;
-    }
-    return -1;
+    const int k = std::bit_width(needed - 1) - kSmallestShift;
+    return k < kClassCount ? k : -1;
 }
 
 namespace {
@@ -26,8 +25,6 @@ constexpr char kMismatchMessage[] = "ShmFree(): mismatched handle and pointer\n"
 constexpr char kDoubleFreeMessage[] = "ShmFree(): double-free\n";
 
 uintptr_t &nextOf(uintptr_t block) { return *reinterpret_cast<uintptr_t *>(block); }
-
-DataArea areaOf(const ShmHandle *h) { return dataAreaOf(h->base, h->size, pageSize()); }
 
 int firstNonEmptyFrom(const ShmHeader *h, int k) {
     for (int j = k; j < kClassCount; j++) {
@@ -39,8 +36,8 @@ int firstNonEmptyFrom(const ShmHeader *h, int k) {
 /* Takes the highest block of class j and splits it down to class k: the
  * upper halves become the only members of the (empty) lists in between.
  * 0 when list j is damaged; nothing has changed then. */
-uintptr_t takeAndSplit(ShmHeader *h, const DataArea &area, int j, int k) {
-    ListCursor cursor(h, area, j);
+uintptr_t takeAndSplit(ShmHeader *h, int j, const ClassShape &shape, int k) {
+    ListCursor cursor(h, j, shape);
     const uintptr_t block = cursor.entry();
     if (block != 0) cursor.advance();
     if (cursor.damaged()) return 0;
@@ -75,18 +72,17 @@ struct ListPosition {
     bool damaged;
 };
 
-ListPosition findPosition(ShmHeader *h, const DataArea &area, int k, uintptr_t p) {
-    ListCursor cursor(h, area, k);
-    ListPosition pos{cursor.link(), nullptr, 0, 0, false};
+// Inlined: ShmFree's walk is on the hot path.
+[[gnu::always_inline]] inline ListPosition findPosition(ShmHeader *h, int k, const ClassShape &shape, uintptr_t p) {
+    ListCursor cursor(h, k, shape);
+    uintptr_t *upperLink = nullptr;
     while (cursor.entry() > p) {
-        pos.upperLink = cursor.link();
-        pos.upper = cursor.entry();
+        upperLink = cursor.link();
         cursor.advance();
     }
-    pos.link = cursor.link();
-    pos.lower = cursor.entry();
-    pos.damaged = cursor.damaged();
-    return pos;
+    // Past the head, the link that leads to the lower neighbour is the upper one's first word.
+    const uintptr_t upper = upperLink != nullptr ? reinterpret_cast<uintptr_t>(cursor.link()) : 0;
+    return {cursor.link(), upperLink, upper, cursor.entry(), cursor.damaged()};
 }
 
 /* Inserts p, of class k, in its list and merges it upward while its
@@ -94,16 +90,17 @@ ListPosition findPosition(ShmHeader *h, const DataArea &area, int k, uintptr_t p
  * writes the merged block's class word, which names the next class.
  * Returns 0, or kDamaged when a list on the way is damaged (p, or what it
  * merged into, is then in no list). */
-int insertAndMerge(ShmHeader *h, const DataArea &area, uintptr_t p, int k, SegmentLock &lock) {
+int insertAndMerge(const ShmHandle *handle, uintptr_t p, int k, SegmentLock &lock) {
+    ShmHeader *h = handle->base;
     for (;; k++) {
-        const ListPosition pos = findPosition(h, area, k, p);
+        const ListPosition pos = findPosition(h, k, shapeOf(handle, k), p);
         if (pos.damaged) return kDamaged;
         if (pos.lower == p) endOnDoubleFree(lock);
         nextOf(p) = pos.lower;
         *pos.link = p;
         if (k == kLargestClass) return 0;
         const uintptr_t size = blockSize(k);
-        if (p % (2 * size) != 0) {
+        if ((p & (2 * size - 1)) != 0) {
             if (pos.lower == 0 || pos.lower != p - size) return 0;
             *pos.link = nextOf(pos.lower);
             *classWordOf(pos.lower) = classWordFor(h, k + 1);
@@ -138,7 +135,7 @@ QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
     lock.markBusy();
     ShmHeader *header = h->base;
     const int j = firstNonEmptyFrom(header, k);
-    const uintptr_t block = j < 0 ? 0 : takeAndSplit(header, areaOf(h), j, k);
+    const uintptr_t block = j < 0 ? 0 : takeAndSplit(header, j, shapeOf(h, j), k);
     lock.release();
     if (block == 0) {
         errno = j < 0 ? ENOMEM : kDamaged;
@@ -151,10 +148,8 @@ QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
 QORBU_API void ShmFree(ShmHandle *h, void *p) {
     if (p == nullptr) return;
     const uintptr_t block = reinterpret_cast<uintptr_t>(p);
-    const DataArea area = areaOf(h);
-    // The word below p is read only once p is known to lie in the data area.
-    const int k = blockClass(h->base, area, block);
-    if (k < 0) {
+    const int k = classNamedBelow(h->base, areaOf(h), block);
+    if (k < 0 || !shapeOf(h, k).fits(block)) {
         reportMismatch();
         return;
     }
@@ -171,7 +166,7 @@ QORBU_API void ShmFree(ShmHandle *h, void *p) {
         return;
     }
     lock.markBusy();
-    if (int err = insertAndMerge(h->base, area, block, k, lock)) {
+    if (int err = insertAndMerge(h, block, k, lock)) {
         lock.release();
         errno = err;
     }
@@ -183,10 +178,9 @@ QORBU_API uint32_t ShmTotalFree(ShmHandle *h) {
         errno = err;
         return 0;
     }
-    const DataArea area = areaOf(h);
     uint32_t total = 0;
     for (int k = 0; k < kClassCount; k++) {
-        ListCursor cursor(h->base, area, k);
+        ListCursor cursor(h->base, k, shapeOf(h, k));
         for (; cursor.entry() != 0; cursor.advance()) total += static_cast<uint32_t>(blockSize(k));
         if (cursor.damaged()) {
             lock.release();
@@ -220,9 +214,8 @@ QORBU_API void ShmPrintFree(FILE *stream, ShmHeader *header) {
 
 __attribute__((visibility("hidden"))) int qorbuShmSummarise(const ShmHandle *h, ShmFreeSummary *summary) {
     *summary = ShmFreeSummary{0, 0, 0};
-    const DataArea area = areaOf(h);
     for (int k = 0; k < kClassCount; k++) {
-        ListCursor cursor(h->base, area, k);
+        ListCursor cursor(h->base, k, shapeOf(h, k));
         for (; cursor.entry() != 0; cursor.advance()) {
             summary->freeBytes += static_cast<uint32_t>(blockSize(k));
             summary->blocks++;
@@ -235,10 +228,9 @@ __attribute__((visibility("hidden"))) int qorbuShmSummarise(const ShmHandle *h, 
 
 __attribute__((visibility("hidden"))) ShmBlockState qorbuShmBlockState(const ShmHandle *h, const void *p) {
     const uintptr_t block = reinterpret_cast<uintptr_t>(p);
-    const DataArea area = areaOf(h);
-    const int k = blockClass(h->base, area, block);
-    if (k < 0) return SHM_BLOCK_FOREIGN;
-    const ListPosition pos = findPosition(h->base, area, k, block);
+    const int k = classNamedBelow(h->base, areaOf(h), block);
+    if (k < 0 || !shapeOf(h, k).fits(block)) return SHM_BLOCK_FOREIGN;
+    const ListPosition pos = findPosition(h->base, k, shapeOf(h, k), block);
     if (pos.damaged) return SHM_BLOCK_DAMAGED;
     return pos.lower == block ? SHM_BLOCK_FREE : SHM_BLOCK_ALLOCATED;
 }

@@ -11,17 +11,6 @@
 #define MAP_FIXED_NOREPLACE 0x100000
 #endif
 
-struct ShmMapping {
-    dev_t dev;
-    ino_t ino;
-    uintptr_t base;
-    uint32_t length;
-    bool writable;
-    int handles;
-    int writers;  // read-write handles among them
-    ShmMapping *next;
-};
-
 namespace qorbu::shm {
 
 namespace {
@@ -149,7 +138,9 @@ int attachMapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t l
         free(m);
         return err;
     }
-    *m = ShmMapping{dev, ino, mapped, length, h->writable != 0, 0, 0, table};
+    *m = ShmMapping{dev, ino, mapped, length, h->writable != 0, 0, 0, table, {}, {}};
+    m->area = dataAreaOf(reinterpret_cast<void *>(mapped), length, pageSize());
+    for (int k = 0; k < kClassCount; k++) m->shapes[k] = ClassShape(m->area, k);
     table = m;
     fillHandle(h, m);
     return 0;

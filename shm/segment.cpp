@@ -14,7 +14,13 @@
 
 namespace qorbu::shm {
 
-uintptr_t pageSize() { return static_cast<uintptr_t>(getpagesize()); }
+std::atomic<uintptr_t> cachedPageSize{0};
+
+uintptr_t readPageSize() {
+    const auto page = static_cast<uintptr_t>(getpagesize());
+    cachedPageSize.store(page, std::memory_order_relaxed);
+    return page;
+}
 
 uint32_t segmentLength(uint32_t size) {
     const uint32_t page = static_cast<uint32_t>(pageSize());
