@@ -1,8 +1,10 @@
 /* Buddy allocation of a segment's data area: 27 power-of-two size classes,
  * split on demand and merged back with free partners. */
+#include "shm/shm_inspect_private.h"
 #include "shm/shm_private.h"
 
 #include <algorithm>
+#include <bit>
 #include <cerrno>
 #include <cstdlib>
 
@@ -13,10 +15,8 @@ int classFor(uint32_t n) {
     // of the block above it: on 64-bit targets an 8-byte block cannot hold
     // both, so requests start at class 1 there.
     const uint64_t needed = std::max<uint64_t>(uint64_t{n} + kClassWordSize, 2 * kClassWordSize);
-    for (int k = 0; k < kClassCount; k++) {
-        if (needed <= blockSize(k)) return k;
-    }
-    return -1;
+    const int k = std::bit_width(needed - 1) - kSmallestShift;
+    return k < kClassCount ? k : -1;
 }
 
 namespace {
@@ -26,12 +26,6 @@ constexpr char kDoubleFreeMessage[] = "ShmFree(): double-free\n";
 
 uintptr_t &nextOf(uintptr_t block) { return *reinterpret_cast<uintptr_t *>(block); }
 
-uintptr_t popHead(ShmHeader *h, int k) {
-    const uintptr_t block = h->freeList[k];
-    h->freeList[k] = nextOf(block);
-    return block;
-}
-
 int firstNonEmptyFrom(const ShmHeader *h, int k) {
     for (int j = k; j < kClassCount; j++) {
         if (h->freeList[j] != 0) return j;
@@ -40,38 +34,20 @@ int firstNonEmptyFrom(const ShmHeader *h, int k) {
 }
 
 /* Takes the highest block of class j and splits it down to class k: the
- * upper halves become the only members of the (empty) lists in between. */
-uintptr_t takeAndSplit(ShmHeader *h, int j, int k) {
-    const uintptr_t block = popHead(h, j);
+ * upper halves become the only members of the (empty) lists in between.
+ * 0 when list j is damaged; nothing has changed then. */
+uintptr_t takeAndSplit(ShmHeader *h, int j, const ClassShape &shape, int k) {
+    ListCursor cursor(h, j, shape);
+    const uintptr_t block = cursor.entry();
+    if (block != 0) cursor.advance();
+    if (cursor.damaged()) return 0;
+    h->freeList[j] = cursor.entry();
     for (int i = j - 1; i >= k; i--) {
         const uintptr_t upper = block + blockSize(i);
         nextOf(upper) = 0;
         h->freeList[i] = upper;
     }
     return block;
-}
-
-/* The class whose freeList slot the word names, or -1 for any other word. */
-int classNamedBy(const ShmHeader *h, uintptr_t word) {
-    const uintptr_t first = classWordFor(h, 0);
-    if (word < first || (word - first) % sizeof(uintptr_t) != 0) return -1;
-    const uintptr_t k = (word - first) / sizeof(uintptr_t);
-    return k < static_cast<uintptr_t>(kClassCount) ? static_cast<int>(k) : -1;
-}
-
-/* Whether p can be a block that ShmAlloc handed out through this handle:
- * inside its data area, and with a class word that names a freeList slot
- * of its header and a block that fits the segment. Reads nothing outside
- * the handle's mapping. */
-bool ownsBlock(const ShmHandle *handle, uintptr_t p) {
-    const uintptr_t base = reinterpret_cast<uintptr_t>(handle->base);
-    const uintptr_t page = pageSize();
-    const uintptr_t end = base + handle->size;
-    if (p < base + page || p >= end || p % kSmallestBlock != 0) return false;
-    const uintptr_t word = *classWordOf(p);
-    if ((word & ~(page - 1)) != base) return false;
-    const int k = classNamedBy(handle->base, word);
-    return k >= 0 && blockSize(k) <= end - p;
 }
 
 void reportMismatch() {
@@ -93,37 +69,44 @@ struct ListPosition {
     uintptr_t *upperLink;  // the link that leads to the upper neighbour
     uintptr_t upper;       // 0 when none
     uintptr_t lower;       // 0 when none
+    bool damaged;
 };
 
-ListPosition findPosition(ShmHeader *h, int k, uintptr_t p) {
-    ListPosition pos{&h->freeList[k], nullptr, 0, 0};
-    while (*pos.link != 0 && *pos.link > p) {
-        pos.upperLink = pos.link;
-        pos.upper = *pos.link;
-        pos.link = &nextOf(pos.upper);
+// Inlined: ShmFree's walk is on the hot path.
+[[gnu::always_inline]] inline ListPosition findPosition(ShmHeader *h, int k, const ClassShape &shape, uintptr_t p) {
+    ListCursor cursor(h, k, shape);
+    uintptr_t *upperLink = nullptr;
+    while (cursor.entry() > p) {
+        upperLink = cursor.link();
+        cursor.advance();
     }
-    pos.lower = *pos.link;
-    return pos;
+    // Past the head, the link that leads to the lower neighbour is the upper one's first word.
+    const uintptr_t upper = upperLink != nullptr ? reinterpret_cast<uintptr_t>(cursor.link()) : 0;
+    return {cursor.link(), upperLink, upper, cursor.entry(), cursor.damaged()};
 }
 
-/* Inserts p in its class's list and merges it upward while its partner is
- * free; ends the process when p is already free. */
-void insertAndMerge(ShmHeader *h, uintptr_t p, SegmentLock &lock) {
-    for (;;) {
-        const int k = classNamedBy(h, *classWordOf(p));
-        const ListPosition pos = findPosition(h, k, p);
+/* Inserts p, of class k, in its list and merges it upward while its
+ * partner is free; ends the process when p is already free. Each merge
+ * writes the merged block's class word, which names the next class.
+ * Returns 0, or kDamaged when a list on the way is damaged (p, or what it
+ * merged into, is then in no list). */
+int insertAndMerge(const ShmHandle *handle, uintptr_t p, int k, SegmentLock &lock) {
+    ShmHeader *h = handle->base;
+    for (;; k++) {
+        const ListPosition pos = findPosition(h, k, shapeOf(handle, k), p);
+        if (pos.damaged) return kDamaged;
         if (pos.lower == p) endOnDoubleFree(lock);
         nextOf(p) = pos.lower;
         *pos.link = p;
-        if (k == kLargestClass) return;
+        if (k == kLargestClass) return 0;
         const uintptr_t size = blockSize(k);
-        if (p % (2 * size) != 0) {
-            if (pos.lower == 0 || pos.lower != p - size) return;
+        if ((p & (2 * size - 1)) != 0) {
+            if (pos.lower == 0 || pos.lower != p - size) return 0;
             *pos.link = nextOf(pos.lower);
             *classWordOf(pos.lower) = classWordFor(h, k + 1);
             p = pos.lower;
         } else {
-            if (pos.upper == 0 || pos.upper != p + size) return;
+            if (pos.upper == 0 || pos.upper != p + size) return 0;
             *pos.upperLink = pos.lower;
             *classWordOf(p) = classWordFor(h, k + 1);
         }
@@ -152,13 +135,12 @@ QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
     lock.markBusy();
     ShmHeader *header = h->base;
     const int j = firstNonEmptyFrom(header, k);
-    if (j < 0) {
-        lock.release();
-        errno = ENOMEM;
+    const uintptr_t block = j < 0 ? 0 : takeAndSplit(header, j, shapeOf(h, j), k);
+    lock.release();
+    if (block == 0) {
+        errno = j < 0 ? ENOMEM : kDamaged;
         return nullptr;
     }
-    const uintptr_t block = takeAndSplit(header, j, k);
-    lock.release();
     *classWordOf(block) = classWordFor(header, k);
     return reinterpret_cast<void *>(block);
 }
@@ -166,17 +148,28 @@ QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
 QORBU_API void ShmFree(ShmHandle *h, void *p) {
     if (p == nullptr) return;
     const uintptr_t block = reinterpret_cast<uintptr_t>(p);
-    if (!ownsBlock(h, block)) {
+    const int k = classNamedBelow(h->base, areaOf(h), block);
+    if (k < 0 || !shapeOf(h, k).fits(block)) {
         reportMismatch();
         return;
     }
+    const uintptr_t word = *classWordOf(block);
     SegmentLock lock(h);
     if (int err = lock.error()) {
         errno = err;
         return;
     }
+    // Another thread may have overwritten the class word meanwhile.
+    if (*classWordOf(block) != word) {
+        lock.release();
+        reportMismatch();
+        return;
+    }
     lock.markBusy();
-    insertAndMerge(h->base, block, lock);
+    if (int err = insertAndMerge(h, block, k, lock)) {
+        lock.release();
+        errno = err;
+    }
 }
 
 QORBU_API uint32_t ShmTotalFree(ShmHandle *h) {
@@ -187,21 +180,59 @@ QORBU_API uint32_t ShmTotalFree(ShmHandle *h) {
     }
     uint32_t total = 0;
     for (int k = 0; k < kClassCount; k++) {
-        for (uintptr_t e = h->base->freeList[k]; e != 0; e = nextOf(e)) {
-            total += static_cast<uint32_t>(blockSize(k));
+        ListCursor cursor(h->base, k, shapeOf(h, k));
+        for (; cursor.entry() != 0; cursor.advance()) total += static_cast<uint32_t>(blockSize(k));
+        if (cursor.damaged()) {
+            lock.release();
+            errno = kDamaged;
+            return 0;
         }
     }
     return total;
 }
 
 QORBU_API void ShmPrintFree(FILE *stream, ShmHeader *header) {
+    // The lists are checked against the process's own mapping of the segment.
+    const uint32_t length = mappedLength(header);
+    const uintptr_t page = pageSize();
+    bool damaged = length == 0;
     for (int k = 0; k < kClassCount; k++) {
         fprintf(stream, "0x%08x [%d] = { ", static_cast<unsigned>(blockSize(k)), k);
-        for (uintptr_t e = header->freeList[k]; e != 0; e = nextOf(e)) {
-            fprintf(stream, "%p%s ", reinterpret_cast<void *>(e), nextOf(e) != 0 ? "," : "");
+        if (length != 0) {
+            ListCursor cursor(header, dataAreaOf(header, length, page), k);
+            while (cursor.entry() != 0) {
+                const uintptr_t e = cursor.entry();
+                cursor.advance();
+                fprintf(stream, "%p%s ", reinterpret_cast<void *>(e), cursor.entry() != 0 ? "," : "");
+            }
+            damaged = damaged || cursor.damaged();
         }
         fputs("}\n", stream);
     }
+    if (damaged) errno = kDamaged;
+}
+
+__attribute__((visibility("hidden"))) int qorbuShmSummarise(const ShmHandle *h, ShmFreeSummary *summary) {
+    *summary = ShmFreeSummary{0, 0, 0};
+    for (int k = 0; k < kClassCount; k++) {
+        ListCursor cursor(h->base, k, shapeOf(h, k));
+        for (; cursor.entry() != 0; cursor.advance()) {
+            summary->freeBytes += static_cast<uint32_t>(blockSize(k));
+            summary->blocks++;
+            summary->largest = static_cast<uint32_t>(blockSize(k));
+        }
+        if (cursor.damaged()) return kDamaged;
+    }
+    return 0;
+}
+
+__attribute__((visibility("hidden"))) ShmBlockState qorbuShmBlockState(const ShmHandle *h, const void *p) {
+    const uintptr_t block = reinterpret_cast<uintptr_t>(p);
+    const int k = classNamedBelow(h->base, areaOf(h), block);
+    if (k < 0 || !shapeOf(h, k).fits(block)) return SHM_BLOCK_FOREIGN;
+    const ListPosition pos = findPosition(h->base, k, shapeOf(h, k), block);
+    if (pos.damaged) return SHM_BLOCK_DAMAGED;
+    return pos.lower == block ? SHM_BLOCK_FREE : SHM_BLOCK_ALLOCATED;
 }
 
 } // extern "C"

@@ -11,16 +11,6 @@
 #define MAP_FIXED_NOREPLACE 0x100000
 #endif
 
-struct ShmMapping {
-    dev_t dev;
-    ino_t ino;
-    uintptr_t base;
-    uint32_t length;
-    bool writable;
-    int handles;
-    ShmMapping *next;
-};
-
 namespace qorbu::shm {
 
 namespace {
@@ -54,12 +44,49 @@ void unlinkMapping(ShmMapping *gone) {
 
 int protectionFor(bool writable) { return writable ? PROT_READ | PROT_WRITE : PROT_READ; }
 
+/* Where the system may place a segment: a header address at which the data
+ * area starts on a multiple of its length rounded up to a power of two (at
+ * most the largest block), so that every block can merge with its partner.
+ * A reservation of the room needed is made and kept in *reserved (0 when
+ * even that fails: the system then picks any address). */
+uintptr_t alignedPlace(uint32_t length, uintptr_t *reserved, size_t *reservedLength) {
+    const uintptr_t page = pageSize();
+    uintptr_t align = page;
+    while (align < length - page && align < blockSize(kLargestClass)) align <<= 1;
+    *reservedLength = length + align;
+    *reserved = 0;
+    if (*reservedLength < length) return 0; // no room in a 32-bit address space
+    void *p = mmap(nullptr, *reservedLength, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
+    if (p == MAP_FAILED) return 0;
+    *reserved = reinterpret_cast<uintptr_t>(p);
+    return ((*reserved + page + align - 1) & ~(align - 1)) - page;
+}
+
 /* Maps at exactly addr without replacing anything there (some kernels and
- * emulators take the flag as a mere hint), or anywhere for addr 0. */
+ * emulators take the flag as a mere hint), or at a place of the library's
+ * choosing for addr 0. */
 int mapSegment(int fd, uintptr_t addr, uint32_t length, bool writable, uintptr_t *mapped) {
-    int flags = MAP_SHARED | (addr != 0 ? MAP_FIXED_NOREPLACE : 0);
+    uintptr_t reserved = 0;
+    size_t reservedLength = 0;
+    int flags = MAP_SHARED;
+    if (addr != 0) {
+        flags |= MAP_FIXED_NOREPLACE;
+    } else if ((addr = alignedPlace(length, &reserved, &reservedLength)) != 0) {
+        flags |= MAP_FIXED; // over this call's own reservation
+    }
     void *p = mmap(reinterpret_cast<void *>(addr), length, protectionFor(writable), flags, fd, 0);
-    if (p == MAP_FAILED) return errno;
+    const int err = errno;
+    if (reserved != 0) {
+        // Give back the parts of the reservation that the segment does not cover.
+        const uintptr_t end = addr + length, reservedEnd = reserved + reservedLength;
+        if (p == MAP_FAILED) {
+            munmap(reinterpret_cast<void *>(reserved), reservedLength);
+        } else {
+            if (addr > reserved) munmap(reinterpret_cast<void *>(reserved), addr - reserved);
+            if (reservedEnd > end) munmap(reinterpret_cast<void *>(end), reservedEnd - end);
+        }
+    }
+    if (p == MAP_FAILED) return err;
     if (addr != 0 && reinterpret_cast<uintptr_t>(p) != addr) {
         munmap(p, length);
         return EEXIST;
@@ -69,13 +96,18 @@ int mapSegment(int fd, uintptr_t addr, uint32_t length, bool writable, uintptr_t
 }
 
 /* A read-only mapping becomes read-write when a read-write handle joins it:
- * the same object mapped again over its own range, contents unchanged. */
+ * the same object mapped again over its own range, contents unchanged. A
+ * failed fixed mapping may have dropped the old one: a read-only view is
+ * put back, so that the other handles keep a mapping. */
 int upgradeToWritable(ShmMapping *m, int fd) {
-    void *p = mmap(reinterpret_cast<void *>(m->base), m->length, PROT_READ | PROT_WRITE,
-                   MAP_SHARED | MAP_FIXED, fd, 0);
-    if (p == MAP_FAILED) return errno;
-    m->writable = true;
-    return 0;
+    void *where = reinterpret_cast<void *>(m->base);
+    if (upgradeMap(where, m->length, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_FIXED, fd, 0) != MAP_FAILED) {
+        m->writable = true;
+        return 0;
+    }
+    const int err = errno;
+    mmap(where, m->length, PROT_READ, MAP_SHARED | MAP_FIXED, fd, 0);
+    return err;
 }
 
 void fillHandle(ShmHandle *h, ShmMapping *m) {
@@ -83,9 +115,12 @@ void fillHandle(ShmHandle *h, ShmMapping *m) {
     h->size = m->length;
     h->mapping = m;
     m->handles++;
+    if (h->writable) m->writers++;
 }
 
 } // namespace
+
+void *(*upgradeMap)(void *, size_t, int, int, int, off_t) = mmap;
 
 int attachMapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t length) {
     TableGuard guard;
@@ -103,7 +138,9 @@ int attachMapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t l
         free(m);
         return err;
     }
-    *m = ShmMapping{dev, ino, mapped, length, h->writable != 0, 0, table};
+    *m = ShmMapping{dev, ino, mapped, length, h->writable != 0, 0, 0, table, {}, {}};
+    m->area = dataAreaOf(reinterpret_cast<void *>(mapped), length, pageSize());
+    for (int k = 0; k < kClassCount; k++) m->shapes[k] = ClassShape(m->area, k);
     table = m;
     fillHandle(h, m);
     return 0;
@@ -114,10 +151,26 @@ void detachMapping(ShmHandle *h) {
     if (m == nullptr) return;
     TableGuard guard;
     h->mapping = nullptr;
-    if (--m->handles > 0) return;
+    if (h->writable) m->writers--;
+    if (--m->handles > 0) {
+        // The read-only handles left must not be able to write the segment.
+        if (m->writers == 0 && m->writable &&
+            mprotect(reinterpret_cast<void *>(m->base), m->length, PROT_READ) == 0) {
+            m->writable = false;
+        }
+        return;
+    }
     unlinkMapping(m);
     munmap(reinterpret_cast<void *>(m->base), m->length);
     free(m);
+}
+
+uint32_t mappedLength(const void *base) {
+    TableGuard guard;
+    for (ShmMapping *m = table; m != nullptr; m = m->next) {
+        if (m->base == reinterpret_cast<uintptr_t>(base)) return m->length;
+    }
+    return 0;
 }
 
 } // namespace qorbu::shm

@@ -7,12 +7,20 @@
 #include <cstring>
 #include <fcntl.h>
 #include <sys/mman.h>
+#include <sys/file.h>
 #include <sys/stat.h>
+#include <time.h>
 #include <unistd.h>
 
 namespace qorbu::shm {
 
-uintptr_t pageSize() { return static_cast<uintptr_t>(getpagesize()); }
+std::atomic<uintptr_t> cachedPageSize{0};
+
+uintptr_t readPageSize() {
+    const auto page = static_cast<uintptr_t>(getpagesize());
+    cachedPageSize.store(page, std::memory_order_relaxed);
+    return page;
+}
 
 uint32_t segmentLength(uint32_t size) {
     const uint32_t page = static_cast<uint32_t>(pageSize());
@@ -58,7 +66,7 @@ struct OpenRequest {
 bool validRequest(const OpenRequest &r) {
     if (r.mode != O_RDONLY && r.mode != O_RDWR) return false;
     if (r.addr % kAddressAlignment != 0) return false;
-    if (r.name[0] == '\0' || strchr(r.name, '/') != nullptr || strchr(r.name, ':') != nullptr) {
+    if (r.name == nullptr || r.name[0] == '\0' || strchr(r.name, '/') != nullptr || strchr(r.name, ':') != nullptr) {
         return false;
     }
     if (r.intent != Intent::Create) return true;
@@ -93,36 +101,66 @@ ShmHandle *closeWithError(ShmHandle *h, int err) {
     return nullptr;
 }
 
-/* Reading the first page of an object with no length yet would fault. */
-int waitForLength(int fd, struct stat *st) {
+/* The attach waits: a creator publishes within moments of creating the
+ * object, so one that has not done so after kPublishWaitMillis died, or
+ * the object is no segment. */
+class Deadline {
+  public:
+    Deadline() { clock_gettime(CLOCK_MONOTONIC, &start_); }
+    /* Sleeps one poll interval; false once the wait has lasted its limit. */
+    bool waitAgain() const {
+        struct timespec now;
+        clock_gettime(CLOCK_MONOTONIC, &now);
+        const long long elapsedNanos =
+            (now.tv_sec - start_.tv_sec) * 1000000000LL + (now.tv_nsec - start_.tv_nsec);
+        if (elapsedNanos >= kPublishWaitMillis * 1000000LL) return false;
+        usleep(kPublishPollMicros);
+        return true;
+    }
+
+  private:
+    struct timespec start_;
+};
+
+/* Reading the first page of an object with no length yet would fault. A
+ * creator sizes the object in one step to whole pages, header and data:
+ * any other length is no segment. */
+int waitForLength(int fd, struct stat *st, const Deadline &deadline) {
     for (;;) {
         if (fstat(fd, st) != 0) return errno;
-        if (st->st_size != 0) return 0;
-        sleep(kPublishPollSeconds);
+        if (st->st_size != 0) break;
+        if (!deadline.waitAgain()) return ETIMEDOUT;
     }
+    const auto page = static_cast<off_t>(pageSize());
+    const auto length = static_cast<unsigned long long>(st->st_size);
+    return st->st_size % page == 0 && st->st_size >= 2 * page && length <= UINT32_MAX ? 0 : EINVAL;
 }
 
 /* Waits, through a read-only view of the first page, until the creator has
  * published the header; returns the recorded base and length. */
-int readPublishedHeader(int fd, uintptr_t *base, uint32_t *size) {
+int readPublishedHeader(int fd, uintptr_t *base, uint32_t *size, const Deadline &deadline) {
     const size_t page = pageSize();
     void *first = mmap(nullptr, page, PROT_READ, MAP_SHARED, fd, 0);
     if (first == MAP_FAILED) return errno;
     const auto *header = static_cast<const ShmHeader *>(first);
-    while ((*size = loadPublishedSize(header)) == 0) sleep(kPublishPollSeconds);
+    int err = 0;
+    while ((*size = loadPublishedSize(header)) == 0 && err == 0) {
+        if (!deadline.waitAgain()) err = ETIMEDOUT;
+    }
     *base = header->base;
     munmap(first, page);
-    return 0;
+    return err;
 }
 
 /* Maps an existing segment at the base recorded in its header, after the
  * header has been published and found sound. */
 int mapExisting(ShmHandle *h) {
+    const Deadline deadline;
     struct stat st;
-    if (int err = waitForLength(h->fd, &st)) return err;
+    if (int err = waitForLength(h->fd, &st, deadline)) return err;
     uintptr_t base = 0;
     uint32_t size = 0;
-    if (int err = readPublishedHeader(h->fd, &base, &size)) return err;
+    if (int err = readPublishedHeader(h->fd, &base, &size, deadline)) return err;
     if (fstat(h->fd, &st) != 0) return errno;
     if (int err = validateHeader(base, size, static_cast<uint64_t>(st.st_size))) return err;
     return attachMapping(h, st.st_dev, st.st_ino, base, size);
@@ -161,24 +199,39 @@ int initialiseFresh(ShmHandle *h, uint32_t length) {
     return 0;
 }
 
-/* Creates and initialises the segment when its object has no length yet;
- * *fresh tells whether it did. */
-int createFresh(ShmHandle *h, const OpenRequest &r, bool *fresh) {
+/* Sizes, maps and initialises the object when it has no length yet; *fresh
+ * tells whether it did. A failure leaves the object empty again, for a
+ * later ShmCreate to initialise. */
+int initialiseIfEmpty(ShmHandle *h, const OpenRequest &r, bool *fresh) {
     struct stat st;
     if (fstat(h->fd, &st) != 0) return errno;
     *fresh = st.st_size == 0;
     if (!*fresh) return 0;
-    // Mapped before it is sized, so that a refused address leaves the object
-    // empty and a later ShmCreate can still initialise it.
+    // Mapped before it is sized, so that a refused address leaves it empty.
     const uint32_t length = segmentLength(r.size);
     const uintptr_t header = r.addr != 0 ? r.addr - pageSize() : 0;
     if (int err = attachMapping(h, st.st_dev, st.st_ino, header, length)) return err;
-    if (ftruncate(h->fd, length) != 0) {
-        const int err = errno;
+    const int err = ftruncate(h->fd, length) != 0 ? errno : initialiseFresh(h, length);
+    if (err != 0) {
         detachMapping(h);
-        return err;
+        ftruncate(h->fd, 0);
     }
-    return 0;
+    return err;
+}
+
+/* Creators that meet on one new name take the object's descriptor lock
+ * before they look at its length and keep it until the header is
+ * published: exactly one of them initialises, the others find it sized
+ * and attach. */
+int createOnce(ShmHandle *h, const OpenRequest &r, bool *fresh) {
+    const Deadline deadline;
+    while (flock(h->fd, LOCK_EX | LOCK_NB) != 0) {
+        if (errno != EWOULDBLOCK && errno != EINTR) return errno;
+        if (!deadline.waitAgain()) return ETIMEDOUT;
+    }
+    const int err = initialiseIfEmpty(h, r, fresh);
+    flock(h->fd, LOCK_UN);
+    return err;
 }
 
 ShmHandle *openSegment(const OpenRequest &r) {
@@ -207,12 +260,9 @@ ShmHandle *openSegment(const OpenRequest &r) {
 
     bool fresh = false;
     if (r.intent == Intent::Create) {
-        if (int err = createFresh(h, r, &fresh)) return discard(h, err);
+        if (int err = createOnce(h, r, &fresh)) return discard(h, err);
     }
-    if (fresh) {
-        if (int err = initialiseFresh(h, h->size)) return closeWithError(h, err);
-        return h;
-    }
+    if (fresh) return h;
     if (int err = mapExisting(h)) return discard(h, err);
     return finishAttach(h);
 }
@@ -234,12 +284,17 @@ QORBU_API ShmHandle *ShmOpen(const char *name, int mode) {
 }
 
 QORBU_API void ShmClose(ShmHandle *h) {
+    if (h == nullptr) return;
     detachMapping(h);
     close(h->fd);
     free(h);
 }
 
 QORBU_API int ShmUnlink(const char *name) {
+    if (name == nullptr) {
+        errno = EINVAL;
+        return -1;
+    }
     char *object = objectName(name);
     if (object == nullptr) return -1;
     const int result = shm_unlink(object);

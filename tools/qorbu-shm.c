@@ -1,5 +1,9 @@
 /* qorbu-shm: create, inspect and remove libqorbu shared segments.
  *
+ * The tool is linked with the library's own objects, so that it checks the
+ * free lists with the allocator's walk (shm/shm_inspect_private.h) instead
+ * of a copy of its own.
+ *
  * Commands that only read (info, dump) attach read-only: a read-write
  * attach switches the segment to the descriptor lock for good, and an
  * inspection must leave the segment as it found it. Before attaching, the
@@ -19,10 +23,11 @@
 #include <unistd.h>
 
 #include "shm/shm.h"
+#include "shm/shm_inspect_private.h"
 
 enum ExitCode {
     EXIT_OK = 0,
-    EXIT_FAILED = 1,      /* the operation failed (no space, system error, corrupt lists) */
+    EXIT_FAILED = 1,      /* the operation failed (no space, system error, damaged segment) */
     EXIT_USAGE = 2,       /* bad command line: unknown command, bad name, size or address */
     EXIT_NO_SEGMENT = 3,  /* no segment of that name */
     EXIT_BUSY = 4,        /* the segment is busy or not published yet */
@@ -30,7 +35,7 @@ enum ExitCode {
     EXIT_DOUBLE_FREE = 6, /* free: the block is free already */
 };
 
-enum { kSizeClasses = 27, kSmallestBlock = 8, kMaxNameLength = 250 };
+enum { kMaxNameLength = 250 };
 
 /* attach() found the segment busy and left the message to its caller. */
 enum { kBusyUnreported = -1 };
@@ -122,6 +127,12 @@ static int object_name(const char *name, char *object, size_t size)
     return snprintf(object, size, "/%s", name) < (int)size ? 0 : -1;
 }
 
+static int not_published(const char *name, const char *why)
+{
+    return fail(EXIT_BUSY, "segment '%s' is not published yet (%s; 'qorbu-shm unlink %s' removes it)", name, why,
+                name);
+}
+
 static int peek_header(const char *name, Peek *peek)
 {
     char object[kMaxNameLength + 2];
@@ -134,9 +145,19 @@ static int peek_header(const char *name, Peek *peek)
     }
     struct stat st;
     const long page = sysconf(_SC_PAGESIZE);
-    if (fstat(fd, &st) != 0 || st.st_size < page) {
+    if (fstat(fd, &st) != 0) {
         close(fd);
-        return fail(EXIT_BUSY, "segment '%s' is not published yet (its creator has not sized it)", name);
+        return fail(EXIT_FAILED, "cannot open segment '%s': %s", name, error_text(errno));
+    }
+    if (st.st_size == 0) {
+        close(fd);
+        return not_published(name, "its creator has not sized it, or died first");
+    }
+    /* A creator sizes the object to whole pages, header and data, at once. */
+    if (st.st_size % page != 0 || st.st_size < 2 * page || (unsigned long long)st.st_size > UINT32_MAX) {
+        close(fd);
+        return fail(EXIT_FAILED, "segment '%s' is damaged: an object of %lld bytes is no segment", name,
+                    (long long)st.st_size);
     }
     const ShmHeader *header = mmap(NULL, (size_t)page, PROT_READ, MAP_SHARED, fd, 0);
     close(fd);
@@ -148,8 +169,9 @@ static int peek_header(const char *name, Peek *peek)
     peek->busy = header->busy;
     munmap((void *)header, (size_t)page);
     if (peek->size == 0)
-        return fail(EXIT_BUSY, "segment '%s' is not published yet (its creator is still initialising it)", name);
-    if (peek->base % (uintptr_t)page != 0 || (off_t)peek->size > st.st_size)
+        return not_published(name, "its creator is still initialising it, or died first");
+    if (peek->base == 0 || peek->base % (uintptr_t)page != 0 || peek->size % (uint32_t)page != 0 ||
+        peek->size < 2 * (uint32_t)page || (off_t)peek->size > st.st_size)
         return fail(EXIT_FAILED, "segment '%s' has a damaged header (base %#" PRIxPTR ", size %" PRIu32 ")", name,
                     peek->base, peek->size);
     return EXIT_OK;
@@ -201,42 +223,9 @@ static ShmHeader *header_of(ShmHandle *handle)
     return (ShmHeader *)((char *)ShmAddr(handle) - ShmOverhead());
 }
 
-/* ---- walking the free lists (read-only) ---------------------------------- */
-
-typedef struct FreeStats {
-    uint32_t freeBytes;
-    uint32_t blocks;
-    uint32_t largest;
-} FreeStats;
-
-static int walk_free_lists(const ShmHeader *header, FreeStats *stats)
+static int damaged_error(const char *name)
 {
-    const uintptr_t dataStart = header->base + (uintptr_t)ShmOverhead();
-    const uintptr_t dataEnd = header->base + header->size;
-    const uintptr_t maxBlocks = (dataEnd - dataStart) / kSmallestBlock;
-    memset(stats, 0, sizeof *stats);
-    for (int k = 0; k < kSizeClasses; ++k) {
-        const uint32_t blockSize = (uint32_t)kSmallestBlock << k;
-        uintptr_t steps = 0;
-        for (uintptr_t block = header->freeList[k]; block; block = *(const uintptr_t *)block) {
-            if (block < dataStart || block + blockSize > dataEnd || ++steps > maxBlocks)
-                return -1;
-            stats->freeBytes += blockSize;
-            ++stats->blocks;
-            if (blockSize > stats->largest)
-                stats->largest = blockSize;
-        }
-    }
-    return 0;
-}
-
-static int block_is_free(const ShmHeader *header, uintptr_t address)
-{
-    for (int k = 0; k < kSizeClasses; ++k)
-        for (uintptr_t block = header->freeList[k]; block; block = *(const uintptr_t *)block)
-            if (block == address)
-                return 1;
-    return 0;
+    return fail(EXIT_FAILED, "segment '%s' has a damaged free list", name);
 }
 
 /* ---- commands ------------------------------------------------------------- */
@@ -255,21 +244,25 @@ static int cmd_create(int argc, char **argv)
                       address < (unsigned long long)ShmOverhead()))
         return fail(EXIT_USAGE, "invalid address '%s': give the data area's address, a multiple of 4096", argv[2]);
 
+    /* The tool claims the name itself, so that it can remove the object
+     * again when the library refuses to make a segment of it. */
     char object[kMaxNameLength + 2];
     object_name(argv[0], object, sizeof object);
-    int existing = shm_open(object, O_RDONLY | O_CLOEXEC, 0);
-    if (existing >= 0) {
-        close(existing);
+    int claimed = shm_open(object, O_RDWR | O_CREAT | O_EXCL | O_CLOEXEC, 0660);
+    if (claimed < 0 && errno == EEXIST)
         return fail(EXIT_EXISTS, "segment '%s' exists already", argv[0]);
-    }
-    ShmHandle *handle = ShmCreate(argv[0], (void *)(uintptr_t)address, (uint32_t)size);
-    if (!handle && errno == EEXIST) { /* the library never maps over memory in use */
-        ShmUnlink(argv[0]);               /* the object it made stays unsized: remove it */
-        return fail(EXIT_FAILED, "cannot create segment '%s' at %#llx: the range is in use in this process",
-                    argv[0], address);
-    }
-    if (!handle)
+    if (claimed < 0)
         return fail(EXIT_FAILED, "cannot create segment '%s': %s", argv[0], error_text(errno));
+    close(claimed);
+    ShmHandle *handle = ShmCreate(argv[0], (void *)(uintptr_t)address, (uint32_t)size);
+    if (!handle) {
+        const int err = errno;
+        ShmUnlink(argv[0]);
+        if (err == EEXIST) /* the library never maps over memory in use */
+            return fail(EXIT_FAILED, "cannot create segment '%s' at %#llx: the range is in use in this process",
+                        argv[0], address);
+        return fail(EXIT_FAILED, "cannot create segment '%s': %s", argv[0], error_text(err));
+    }
     const ShmHeader *header = header_of(handle);
     printf("created %s: header %#" PRIxPTR ", data %p, %" PRIu32 " bytes in all, %" PRIu32 " data bytes free\n",
            argv[0], header->base, ShmAddr(handle), header->size, ShmTotalFree(handle));
@@ -296,9 +289,9 @@ static int cmd_info(int argc, char **argv)
     const ShmHeader *header = header_of(handle);
     peek = (Peek){header->base, header->size, header->useFlock, header->busy};
     print_header_fields(argv[0], &peek);
-    FreeStats stats;
-    if (walk_free_lists(header, &stats) != 0) {
-        status = fail(EXIT_FAILED, "segment '%s' has a damaged free list", argv[0]);
+    ShmFreeSummary stats;
+    if (qorbuShmSummarise(handle, &stats) != 0) {
+        status = damaged_error(argv[0]);
     } else {
         printf("free      %" PRIu32 "\n", stats.freeBytes);
         printf("blocks    %" PRIu32 " free\n", stats.blocks);
@@ -319,11 +312,11 @@ static int cmd_dump(int argc, char **argv)
     if (status != EXIT_OK)
         return status;
     ShmHeader *header = header_of(handle);
-    FreeStats stats;
+    ShmFreeSummary stats;
     if (header->busy)
         status = busy_error(argv[0]);
-    else if (walk_free_lists(header, &stats) != 0)
-        status = fail(EXIT_FAILED, "segment '%s' has a damaged free list", argv[0]);
+    else if (qorbuShmSummarise(handle, &stats) != 0)
+        status = damaged_error(argv[0]);
     else
         ShmPrintFree(stdout, header);
     ShmClose(handle);
@@ -344,9 +337,17 @@ static int cmd_alloc(int argc, char **argv)
     status = attach(argv[0], O_RDWR, &handle, NULL);
     if (status != EXIT_OK)
         return status;
-    void *block = ShmAlloc(handle, (uint32_t)size);
+    /* A damaged segment is refused as a whole, as info reports it. */
+    ShmFreeSummary stats;
+    void *block = NULL;
+    if (qorbuShmSummarise(handle, &stats) == 0)
+        block = ShmAlloc(handle, (uint32_t)size);
+    else
+        errno = EUCLEAN;
     if (block)
         printf("%p\n", block);
+    else if (errno == EUCLEAN)
+        status = damaged_error(argv[0]);
     else if (errno == ENOMEM)
         status = fail(EXIT_FAILED, "no free block of %llu bytes in segment '%s'", size, argv[0]);
     else if (errno == EBUSY)
@@ -359,24 +360,21 @@ static int cmd_alloc(int argc, char **argv)
 
 /* The library refuses a foreign pointer with a message and ends the process
  * on a double free; the tool checks first so that both get an exit code. */
-static int check_block(const ShmHeader *header, uintptr_t address, const char *text)
+static int check_block(const ShmHandle *handle, uintptr_t address, const char *text)
 {
-    const uintptr_t dataStart = header->base + (uintptr_t)ShmOverhead();
-    const uintptr_t dataEnd = header->base + header->size;
-    if (address < dataStart || address >= dataEnd || address % kSmallestBlock != 0)
-        return fail(EXIT_USAGE, "address %s is not a block of this segment's data area (%#" PRIxPTR "..%#" PRIxPTR ")",
-                    text, dataStart, dataEnd);
-    const uintptr_t classWord = *(const uintptr_t *)(address - sizeof(uintptr_t));
-    const uintptr_t firstSlot = (uintptr_t)&header->freeList[0];
-    const uintptr_t slot = classWord - firstSlot;
-    if (classWord < firstSlot || slot % sizeof(uintptr_t) != 0 || slot / sizeof(uintptr_t) >= kSizeClasses)
-        return fail(EXIT_USAGE, "address %s is not the start of an allocated block", text);
-    const uintptr_t blockSize = (uintptr_t)kSmallestBlock << (slot / sizeof(uintptr_t));
-    if ((address - dataStart) % blockSize != 0 || address + blockSize > dataEnd)
-        return fail(EXIT_USAGE, "address %s is not the start of an allocated block", text);
-    if (block_is_free(header, address))
+    switch (qorbuShmBlockState(handle, (const void *)address)) {
+    case SHM_BLOCK_ALLOCATED:
+        return EXIT_OK;
+    case SHM_BLOCK_FREE:
         return fail(EXIT_DOUBLE_FREE, "the block at %s is free already", text);
-    return EXIT_OK;
+    case SHM_BLOCK_DAMAGED:
+        return EXIT_FAILED;
+    default:
+        break;
+    }
+    const uintptr_t dataStart = (uintptr_t)ShmAddr((ShmHandle *)handle);
+    return fail(EXIT_USAGE, "address %s is not a block of this segment's data area (%#" PRIxPTR
+                "..%#" PRIxPTR ")", text, dataStart, dataStart + handle->size - (uintptr_t)ShmOverhead());
 }
 
 static int cmd_free(int argc, char **argv)
@@ -394,12 +392,23 @@ static int cmd_free(int argc, char **argv)
     if (status != EXIT_OK)
         return status;
     ShmHeader *header = header_of(handle);
+    ShmFreeSummary stats;
     if (header->busy)
         status = busy_error(argv[0]);
+    else if (qorbuShmSummarise(handle, &stats) != 0)
+        status = damaged_error(argv[0]);
     else
-        status = check_block(header, (uintptr_t)address, argv[1]);
-    if (status == EXIT_OK)
+        status = check_block(handle, (uintptr_t)address, argv[1]);
+    if (status == EXIT_OK) {
+        errno = 0;
         ShmFree(handle, (void *)(uintptr_t)address);
+        if (errno == EUCLEAN)
+            status = damaged_error(argv[0]);
+        else if (errno == EBUSY)
+            status = busy_error(argv[0]);
+        else if (errno != 0)
+            status = fail(EXIT_FAILED, "cannot free in segment '%s': %s", argv[0], error_text(errno));
+    }
     ShmClose(handle);
     return status;
 }

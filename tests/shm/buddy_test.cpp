@@ -4,13 +4,16 @@
  * the lists equal the model's, stay strictly descending, keep no free
  * partners apart and tile the data area with the allocated blocks. */
 #include "shm/shm.h"
+#include "shm/shm_private.h"
 #include "shm_model.h"
 #include "shm_test_util.h"
 
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <map>
+#include <optional>
 #include <random>
+#include <thread>
 
 using namespace qorbu::test;
 
@@ -74,10 +77,14 @@ std::string expectedDump(Lists lists) {
     return text;
 }
 
-/* On an aligned segment freeing everything must restore the fresh lists. */
-void runSequence(uint32_t dataBytes, unsigned seed, int operations, bool aligned) {
+/* At a caller's page-aligned address, or where the library places it; there
+ * the data area is aligned to its size, and freeing everything must restore
+ * the fresh lists. */
+void runSequence(uint32_t dataBytes, unsigned seed, int operations, bool placedByLibrary) {
     NameGuard name("model");
-    ShmHandle *h = aligned ? createAligned(name.c_str(), dataBytes) : ShmCreate(name.c_str(), nullptr, dataBytes);
+    uintptr_t fixedHeader = 0;
+    ShmHandle *h = placedByLibrary ? ShmCreate(name.c_str(), nullptr, dataBytes)
+                                   : createAtFreeAddress(name.c_str(), dataBytes, &fixedHeader);
     ASSERT_NE(h, nullptr);
     BuddyModel model(reinterpret_cast<uintptr_t>(h->base), h->size);
     ASSERT_TRUE(listsMatch(h->base, model)) << "fresh segment";
@@ -118,7 +125,7 @@ void runSequence(uint32_t dataBytes, unsigned seed, int operations, bool aligned
     }
     EXPECT_TRUE(listsMatch(h->base, model));
     EXPECT_EQ(checkLists(h->base, {}), "");
-    if (aligned) {
+    if (placedByLibrary) {
         EXPECT_TRUE(listsMatch(h->base, BuddyModel(reinterpret_cast<uintptr_t>(h->base), h->size)))
             << "all freed: the lists of a fresh segment";
     }
@@ -310,9 +317,132 @@ TEST(ShmModel, RandomSequencesOnSegmentsOfManyShapes) {
         runSequence(bytes, seed++, scaled(4000, 800), false);
         if (HasFatalFailure()) return;
     }
-    for (uint32_t bytes : {page, 1u << 16, 1u << 20, 4u << 20}) {
-        SCOPED_TRACE("aligned, data bytes " + std::to_string(bytes));
+    for (uint32_t bytes : {page, 37 * page, 1u << 16, 1u << 20, 4u << 20}) {
+        SCOPED_TRACE("placed by the library, data bytes " + std::to_string(bytes));
         runSequence(bytes, seed++, scaled(4000, 800), true);
         if (HasFatalFailure()) return;
     }
+}
+
+/* Where the library places a segment, its data area is aligned to its size
+ * rounded up to a power of two, so that every block merges back. */
+TEST(ShmAlloc, SegmentsPlacedByTheLibraryMergeBackIntoTheirLargestBlocks) {
+    NameGuard name("placed");
+    for (uint32_t bytes : {1u << 16, 37 * uint32_t(pageBytes())}) {
+        ShmHandle *h = ShmCreate(name.c_str(), nullptr, bytes);
+        ASSERT_NE(h, nullptr);
+        uint32_t align = 1;
+        while (align < bytes) align <<= 1;
+        EXPECT_EQ(reinterpret_cast<uintptr_t>(ShmAddr(h)) % align, 0u) << bytes;
+        std::vector<void *> blocks;
+        for (void *p; (p = ShmAlloc(h, 4000)) != nullptr;) blocks.push_back(p);
+        EXPECT_EQ(blocks.size(), bytes / 4096);
+        for (void *p : blocks) ShmFree(h, p);
+        void *largest = ShmAlloc(h, (1u << (31 - __builtin_clz(bytes))) - 100);
+        EXPECT_NE(largest, nullptr) << bytes << ": the freed blocks did not merge back";
+        ShmFree(h, largest);
+        EXPECT_EQ(ShmTotalFree(h), bytes);
+        ShmClose(h);
+        ShmUnlink(name.c_str());
+    }
+}
+
+/* ShmFree checks the class word before the lock; a word overwritten while
+ * it waits for the lock must be caught again under it. */
+TEST(ShmFree, ClassWordOverwrittenWhileWaitingForTheLockChangesNothing) {
+    NameGuard name("reread");
+    ShmHandle *h = ShmCreate(name.c_str(), nullptr, 1u << 16);
+    ASSERT_NE(h, nullptr);
+    void *p = ShmAlloc(h, 100);
+    ASSERT_NE(p, nullptr);
+    const ListHeads lists(h->base);
+    auto *word = reinterpret_cast<uintptr_t *>(p) - 1;
+    const uintptr_t sound = *word;
+    std::optional<qorbu::shm::SegmentLock> lock(std::in_place, h);
+    ASSERT_EQ(lock->error(), 0);
+    testing::internal::CaptureStderr();
+    std::thread freer([&] { ShmFree(h, p); });
+    usleep(300 * 1000); // the free waits for the lock by now (else it sees the word below anyway)
+    *word = reinterpret_cast<uintptr_t>(&h->base->size); // in the header page, naming no list
+    lock.reset();
+    freer.join();
+    EXPECT_EQ(testing::internal::GetCapturedStderr(), "ShmFree(): mismatched handle and pointer\n");
+    EXPECT_TRUE(lists.unchanged());
+    EXPECT_EQ(h->base->busy, 0u);
+    EXPECT_EQ(h->base->useFlock, 0u);
+    *word = sound;
+    ShmFree(h, p);
+    EXPECT_EQ(ShmTotalFree(h), 1u << 16);
+    ShmClose(h);
+}
+
+/* Damaged lists, as a stray write or a dying process leaves them: every
+ * operation that meets the damage fails with EUCLEAN, changes nothing,
+ * leaves busy and the lock free, and neither faults nor loops (each case
+ * runs in a child that an alarm ends). */
+TEST(ShmDamage, DamagedListsAreReportedNeverFollowed) {
+    const uintptr_t page = pageBytes();
+    NameGuard name("damage");
+    ShmHandle *h = ShmCreate(name.c_str(), nullptr, 1u << 16);
+    ASSERT_NE(h, nullptr);
+    const uintptr_t data = reinterpret_cast<uintptr_t>(ShmAddr(h)), end = data + (1u << 16);
+    // List 9 (4 KiB) becomes { data + 12 KiB, data }; `kept` is allocated in between.
+    void *first = ShmAlloc(h, 4000), *kept = ShmAlloc(h, 4000), *third = ShmAlloc(h, 4000);
+    ASSERT_EQ(reinterpret_cast<uintptr_t>(first), data);
+    ShmFree(h, first);
+    ASSERT_EQ(walkList(h->base, 9, 4), (std::vector<uintptr_t>{data + 0x3000, data}));
+    ASSERT_EQ(walkList(h->base, 11, 4), (std::vector<uintptr_t>{data + 0x4000}));
+    uintptr_t *head = &h->base->freeList[9], *link = reinterpret_cast<uintptr_t *>(data + 0x3000);
+    const struct {
+        const char *what;
+        uintptr_t *word;
+        uintptr_t value;
+        bool walksOnly = false;  // list 11, which only the whole-segment walks visit
+    } cases[] = {
+        {"head in the header page", head, reinterpret_cast<uintptr_t>(h->base) + 64},
+        {"head not aligned to its class", head, data + 0x3000 + 8},
+        {"head at the end of the data area", head, end},
+        {"head far outside the mapping", head, ~uintptr_t(page - 1)},
+        {"block linked to itself", link, data + 0x3000},
+        {"link to a higher block", link, data + 0x8000},
+        {"link below the data area", link, data - page},
+        // Page-aligned and below, but overlapping the 16 KiB block above it.
+        {"link to an overlapping block", reinterpret_cast<uintptr_t *>(data + 0x4000), data + 0x1000, true},
+    };
+    FILE *sink = fopen("/dev/null", "w");
+    ASSERT_NE(sink, nullptr);
+    for (const auto &c : cases) {
+        SCOPED_TRACE(c.what);
+        const uintptr_t saved = *c.word;
+        *c.word = c.value;
+        const ListHeads lists(h->base);
+        const int status = runInChild(
+            [&] {
+                errno = 0;
+                if (ShmTotalFree(h) != 0 || errno != EUCLEAN) return 1;
+                if (!c.walksOnly) {
+                    errno = 0;
+                    if (ShmAlloc(h, 4000) != nullptr || errno != EUCLEAN) return 2;
+                    errno = 0;
+                    ShmFree(h, kept);
+                    if (errno != EUCLEAN) return 3;
+                }
+                errno = 0;
+                ShmPrintFree(sink, h->base);
+                return errno == EUCLEAN ? 0 : 4;
+            },
+            60);
+        EXPECT_EQ(status, 0) << "1 count, 2 alloc, 3 free, 4 dump; above 128 a signal";
+        EXPECT_TRUE(lists.unchanged());
+        EXPECT_EQ(*c.word, c.value);
+        EXPECT_EQ(h->base->busy, 0u);
+        EXPECT_EQ(pthread_mutex_trylock(&h->base->mutex), 0) << "the lock was left held";
+        pthread_mutex_unlock(&h->base->mutex);
+        *c.word = saved;
+    }
+    fclose(sink);
+    ShmFree(h, kept);
+    ShmFree(h, third);
+    EXPECT_EQ(ShmTotalFree(h), 1u << 16) << "the segment works again once repaired";
+    ShmClose(h);
 }

@@ -98,7 +98,7 @@ pid_t startLockHolder(const char *name, bool busy) {
 
 TEST(ShmStress, FourProcessesAllocateAndFreeAtRandom) {
     NameGuard name("stress");
-    ShmHandle *h = createAligned(name.c_str(), 16u << 20);
+    ShmHandle *h = ShmCreate(name.c_str(), nullptr, 16u << 20);
     ASSERT_NE(h, nullptr);
     runWorkers(name.c_str(), 4, 1000, scaled(20000, 2000));
     EXPECT_EQ(h->base->useFlock, 1u);
@@ -110,7 +110,7 @@ TEST(ShmStress, FourProcessesAllocateAndFreeAtRandom) {
 TEST(ShmCrash, HolderKilledOutsideAnOperationLosesNothing) {
     if (kEmulated) GTEST_SKIP() << "qemu-user lacks robust mutexes (set_robust_list)";
     NameGuard name("crash-out");
-    ShmHandle *h = createAligned(name.c_str(), 4u << 20);
+    ShmHandle *h = ShmCreate(name.c_str(), nullptr, 4u << 20);
     ASSERT_NE(h, nullptr);
     const pid_t holder = startLockHolder(name.c_str(), false);
     ASSERT_GT(holder, 0);

@@ -6,9 +6,12 @@
 #include "shm_model.h"
 #include "shm_test_util.h"
 
+#include <chrono>
 #include <fcntl.h>
 #include <gtest/gtest.h>
+#include <set>
 #include <sys/file.h>
+#include <vector>
 
 using namespace qorbu::test;
 
@@ -43,6 +46,10 @@ TEST(ShmValidation, BadArgumentsRefusedAndSmallSizesRoundedToTwoPages) {
         EXPECT_REFUSED(EINVAL, ShmCreate(bad, nullptr, 4096));
         EXPECT_REFUSED(EINVAL, ShmOpen(bad, O_RDONLY));
     }
+    EXPECT_REFUSED(EINVAL, ShmCreate(nullptr, nullptr, 4096));
+    EXPECT_REFUSED(EINVAL, ShmOpen(nullptr, O_RDONLY));
+    EXPECT_ERRNO(EINVAL, EXPECT_EQ(ShmUnlink(nullptr), -1));
+    ShmClose(nullptr);
     EXPECT_REFUSED(EINVAL, ShmCreate(n, nullptr, 0));
     EXPECT_REFUSED(EINVAL, ShmCreate(n, nullptr, UINT32_MAX));
     EXPECT_REFUSED(EINVAL, ShmCreate(n, nullptr, UINT32_MAX - 2 * uint32_t(pageBytes()) + 2)); // first to wrap
@@ -116,9 +123,32 @@ TEST(ShmSegment, HandlesShareOneMappingAndReadOnlyOnesRefuseLockedOperations) {
     EXPECT_ERRNO(EBADF, ShmFree(reader, block));
     EXPECT_EQ(ShmTotalFree(writer), freeBytes) << "the read-only free changed the lists";
     EXPECT_NE(ShmMetadata(reader, 16), nullptr);
-    ShmClose(reader); // the handle that mapped first
-    ShmFree(writer, block);
+    // The last read-write handle turns the mapping back to read-only.
+    ShmHandle *second = ShmOpen(name.c_str(), O_RDWR);
+    ASSERT_NE(second, nullptr);
+    ShmClose(writer);
+    EXPECT_TRUE(mappedWritable(base));
+    ShmFree(second, block);
+    ShmClose(second);
+    EXPECT_FALSE(mappedWritable(base)) << "a read-only handle could write the segment";
+
+    // An upgrade whose mapping fails (and drops the old one) leaves the reader its mapping.
+    const int fds = openDescriptorCount();
+    qorbu::shm::upgradeMap = [](void *addr, size_t length, int, int, int, off_t) -> void * {
+        munmap(addr, length);
+        errno = ENOMEM;
+        return MAP_FAILED;
+    };
+    EXPECT_REFUSED(ENOMEM, ShmOpen(name.c_str(), O_RDWR));
+    qorbu::shm::upgradeMap = mmap;
+    EXPECT_EQ(openDescriptorCount(), fds);
+    ASSERT_EQ(reinterpret_cast<uintptr_t>(reader->base), base);
+    EXPECT_EQ(reader->base->base, base) << "the reader's mapping is gone";
+    EXPECT_FALSE(mappedWritable(base));
+    writer = ShmOpen(name.c_str(), O_RDWR);
+    ASSERT_NE(writer, nullptr);
     EXPECT_EQ(ShmTotalFree(writer), dataBytes);
+    ShmClose(reader); // the handle that mapped first
     ShmClose(writer);
     EXPECT_TRUE(rangeIsFree(base, dataBytes + pageBytes()));
 }
@@ -187,11 +217,11 @@ TEST(ShmPublication, AttacherWaitsForLengthThenPublication) {
             return ShmTotalFree(h) == size - pageBytes() ? 0 : 3;
         },
         120);
-    sleep(1);
+    usleep(500 * 1000); // both pauses well within the attach's bound
     ASSERT_EQ(ftruncate(fd, size), 0);
     auto *hdr = static_cast<ShmHeader *>(mmap(nullptr, size, PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0));
     ASSERT_NE(hdr, MAP_FAILED);
-    sleep(1);
+    usleep(500 * 1000);
     hdr->base = reinterpret_cast<uintptr_t>(hdr);
     qorbu::shm::divideDataArea(hdr, size);
     ASSERT_EQ(qorbu::shm::initSegmentMutex(&hdr->mutex), 0);
@@ -200,6 +230,103 @@ TEST(ShmPublication, AttacherWaitsForLengthThenPublication) {
     EXPECT_EQ(hdr->useFlock, 1u);
     munmap(hdr, size);
     close(fd);
+}
+
+/* A creator that died before sizing or publishing, and an object that is no
+ * segment: every attach gives up (ETIMEDOUT after the documented wait,
+ * EINVAL at once) and keeps nothing. The calls run side by side in
+ * children that an alarm ends. */
+TEST(ShmPublication, HalfMadeAndJunkObjectsAreGivenUpOn) {
+    using Clock = std::chrono::steady_clock;
+    const off_t page = off_t(pageBytes());
+    const struct {
+        const char *what;
+        off_t length;
+        int err;
+    } objects[] = {{"never sized", 0, ETIMEDOUT}, {"sized, never published", 3 * page, ETIMEDOUT},
+                   {"100 bytes of junk", 100, EINVAL}};
+    std::vector<NameGuard> names;
+    names.reserve(std::size(objects)); // a NameGuard unlinks its name when it goes
+    std::vector<std::pair<std::string, pid_t>> children;
+    for (const auto &o : objects) {
+        names.emplace_back("half");
+        const int fd = shm_open(names.back().path().c_str(), O_RDWR | O_CREAT, 0600);
+        ASSERT_GE(fd, 0);
+        ASSERT_EQ(ftruncate(fd, o.length), 0);
+        if (o.length == 100) {
+            ASSERT_EQ(write(fd, std::string(100, 'x').data(), 100), 100);
+        }
+        close(fd);
+        for (int call = 0; call < 3; call++) {
+            if (call == 2 && o.length == 0) continue; // ShmCreate initialises an empty object
+            const char *name = names.back().c_str();
+            const pid_t pid = startChild(
+                [=] {
+                    const int fds = openDescriptorCount();
+                    const auto start = Clock::now();
+                    errno = 0;
+                    ShmHandle *h = call == 0 ? ShmOpen(name, O_RDONLY)
+                                   : call == 1 ? ShmOpen(name, O_RDWR) : ShmCreate(name, nullptr, 4096);
+                    const int err = errno;
+                    const auto waited = std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - start);
+                    if (h != nullptr || err != o.err) return 1;
+                    if (openDescriptorCount() != fds) return 2;
+                    if (o.err == ETIMEDOUT && waited.count() < qorbu::shm::kPublishWaitMillis) return 3;
+                    return 0;
+                },
+                60);
+            children.emplace_back(std::string(o.what) + ", call " + std::to_string(call), pid);
+        }
+    }
+    for (const auto &[what, pid] : children) {
+        EXPECT_EQ(waitStatus(pid), 0) << what << " (1 result, 2 descriptors, 3 gave up early; 142 hung)";
+    }
+    struct stat st;
+    for (size_t i = 0; i < names.size(); i++) {
+        const int fd = shm_open(names[i].path().c_str(), O_RDONLY, 0);
+        ASSERT_GE(fd, 0);
+        ASSERT_EQ(fstat(fd, &st), 0);
+        EXPECT_EQ(st.st_size, objects[i].length) << "a refused attach changed the object";
+        close(fd);
+    }
+}
+
+/* Creators that meet on one new name: exactly one initialises it, the
+ * others attach, so no block goes to two of them. */
+TEST(ShmPublication, CreatorsRacingOnOneNameInitialiseItOnce) {
+    constexpr int kCreators = 4;
+    for (int round = 0; round < scaled(20, 6); round++) {
+        NameGuard name("race");
+        int go[2], result[2];
+        ASSERT_EQ(pipe(go), 0);
+        ASSERT_EQ(pipe(result), 0);
+        std::vector<pid_t> pids;
+        for (int i = 0; i < kCreators; i++) {
+            pids.push_back(startChild(
+                [&] {
+                    close(go[1]);
+                    char c;
+                    if (read(go[0], &c, 1) != 0) return 1; // all start at the end of the pipe
+                    ShmHandle *h = ShmCreate(name.c_str(), nullptr, 1u << 16);
+                    const auto block = reinterpret_cast<uintptr_t>(h != nullptr ? ShmAlloc(h, 1000) : nullptr);
+                    return block != 0 && write(result[1], &block, sizeof block) == sizeof block ? 0 : 2;
+                },
+                120));
+        }
+        close(go[0]);
+        close(result[1]);
+        close(go[1]);
+        std::set<uintptr_t> blocks;
+        for (uintptr_t block; read(result[0], &block, sizeof block) == sizeof block;) blocks.insert(block);
+        close(result[0]);
+        for (pid_t pid : pids) EXPECT_EQ(waitStatus(pid), 0);
+        EXPECT_EQ(blocks.size(), size_t(kCreators)) << "round " << round << ": a block went to two creators";
+        ShmHandle *h = ShmOpen(name.c_str(), O_RDWR);
+        ASSERT_NE(h, nullptr);
+        EXPECT_EQ(ShmTotalFree(h), (1u << 16) - kCreators * 1024u);
+        ShmClose(h);
+        if (HasFailure()) return;
+    }
 }
 
 TEST(ShmBusy, SegmentLeftBusyRefusesLockedOperationsAndReadWriteAttach) {

@@ -67,15 +67,21 @@ inline ShmHandle *createAtFreeAddress(const char *name, uint32_t size, uintptr_t
     return ShmCreate(name, reinterpret_cast<void *>(*header + pageBytes()), size);
 }
 
-/* A segment whose data area starts on a multiple of its power-of-two size:
- * all partners pair up, so freeing everything restores the fresh lists. */
-inline ShmHandle *createAligned(const char *name, uint32_t dataBytes) {
-    for (uintptr_t candidate : kHeaderCandidates) {
-        const uintptr_t data = (candidate + dataBytes) & ~uintptr_t(dataBytes - 1);
-        ShmHandle *h = ShmCreate(name, reinterpret_cast<void *>(data), dataBytes);
-        if (h != nullptr || errno != EEXIST) return h;
+/* Whether the mapping that holds addr may be written, as /proc/self/maps shows it. */
+inline bool mappedWritable(uintptr_t addr) {
+    FILE *maps = fopen("/proc/self/maps", "r");
+    if (maps == nullptr) return false;
+    bool writable = false;
+    unsigned long long start = 0, end = 0;
+    char perms[8] = "";
+    char line[512];
+    while (fgets(line, sizeof line, maps) != nullptr) {
+        if (sscanf(line, "%llx-%llx %7s", &start, &end, perms) == 3 && start <= addr && addr < end) {
+            writable = perms[1] == 'w';
+        }
     }
-    return nullptr;
+    fclose(maps);
+    return writable;
 }
 
 inline int openDescriptorCount() {

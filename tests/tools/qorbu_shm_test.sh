@@ -139,11 +139,41 @@ case_busy_segment() {
 }
 
 case_unpublished_segment() {
-    "$POKE" empty "$NAME" || { echo "FAIL: shm_poke"; exit 1; }
-    # The library's attach would wait for the creator; the tool must not.
-    run 4 info "$NAME";        one_line_error "segment '$NAME' is not published yet"
-    run 4 dump "$NAME";        one_line_error "is not published yet"
+    # Unsized, and sized but never published (a creator that died): the tool
+    # says so at once, and unlink removes them.
+    for poke in empty "sized 12288"; do
+        set -- $poke
+        "$POKE" "$1" "$NAME" "${@:2}" || { echo "FAIL: shm_poke"; exit 1; }
+        run 4 info "$NAME";    one_line_error "segment '$NAME' is not published yet.*qorbu-shm unlink $NAME"
+        run 4 dump "$NAME";    one_line_error "is not published yet"
+        run 4 alloc "$NAME" 8; one_line_error "is not published yet"
+        run 0 unlink "$NAME"
+        run 3 info "$NAME"
+    done
+    # An object no creator makes is damaged, not unpublished.
+    "$POKE" sized "$NAME" 100
+    for command in info dump "alloc 8" "free 0x1000"; do
+        set -- $command
+        run 1 "$1" "$NAME" "${@:2}"
+        one_line_error "segment '$NAME' is damaged: an object of 100 bytes is no segment"
+    done
     run 0 unlink "$NAME"
+}
+
+case_damaged_segment() {
+    run 0 create "$NAME" 64k
+    run 0 alloc "$NAME" 100
+    local block; block=$(cat "$OUT")
+    "$POKE" loop "$NAME" || { echo "FAIL: shm_poke"; exit 1; }
+    for command in info dump "alloc 100" "free $block"; do
+        set -- $command
+        run 1 "$1" "$NAME" "${@:2}"
+        one_line_error "segment '$NAME' has a damaged free list"
+    done
+    # A create that the library refuses leaves no object behind.
+    run 0 unlink "$NAME"
+    run 1 create "$NAME" 8k 0x1000;   one_line_error "cannot create segment '$NAME'"
+    run 3 info "$NAME"
 }
 
 "case_$CASE"
