@@ -14,22 +14,22 @@ enum { kSizeClasses = 27, kSmallestBlock = 8 };
 
 /* Free bytes counted by walking the free lists without taking the segment
  * lock: for read-only handles, at moments when nobody allocates or frees.
- * Returns 0 and sets *freeBytes, or -1 if a list leaves the data area. */
-static int count_free(const ShmHeader *header, uint32_t *freeBytes) {
-    const uintptr_t dataStart = header->base + (uintptr_t)getpagesize();
-    const uintptr_t dataEnd = header->base + header->size;
-    const uintptr_t maxBlocks = (dataEnd - dataStart) / kSmallestBlock;
+ * Returns 0 and sets *free_bytes, or -1 if a list leaves the data area. */
+static int count_free(const ShmHeader *header, uint32_t *free_bytes) {
+    const uintptr_t data_start = header->base + (uintptr_t)getpagesize();
+    const uintptr_t data_end = header->base + header->size;
+    const uintptr_t max_blocks = (data_end - data_start) / kSmallestBlock;
     uint32_t total = 0;
     for (int k = 0; k < kSizeClasses; ++k) {
-        const uint32_t blockSize = (uint32_t)kSmallestBlock << k;
+        const uint32_t block_size = (uint32_t)kSmallestBlock << k;
         uintptr_t steps = 0;
         for (uintptr_t block = header->freeList[k]; block; block = *(const uintptr_t *)block) {
-            if (block < dataStart || block >= dataEnd || ++steps > maxBlocks)
+            if (block < data_start || block >= data_end || ++steps > max_blocks)
                 return -1;
-            total += blockSize;
+            total += block_size;
         }
     }
-    *freeBytes = total;
+    *free_bytes = total;
     return 0;
 }
 
@@ -38,10 +38,10 @@ static int walk_records(const DemoSummary *summary, unsigned int *records, unsig
     unsigned long long total = 0;
     for (uintptr_t at = summary->records; at; at = ((const DemoConnection *)at)->next) {
         const DemoConnection *record = (const DemoConnection *)at;
-        if (record->magic != DEMO_RECORD_MAGIC || count > summary->openConnections)
+        if (record->magic != DEMO_RECORD_MAGIC || count > summary->open_connections)
             return -1;
         ++count;
-        total += record->bytesEchoed;
+        total += record->bytes_echoed;
     }
     *records = count;
     *bytes = total;
@@ -57,18 +57,18 @@ int inspect_segment(const char *name) {
     const ShmHeader *header = (const ShmHeader *)((char *)ShmAddr(segment) - ShmOverhead());
     const DemoSummary *summary = ShmMetadata(segment, sizeof(DemoSummary));
     unsigned int records = 0;
-    unsigned long long recordBytes = 0;
-    uint32_t freeBytes = 0;
+    unsigned long long record_bytes = 0;
+    uint32_t free_bytes = 0;
     int status = 0;
     if (!summary || summary->magic != DEMO_SUMMARY_MAGIC) {
         fprintf(stderr, "qorbu-demo --inspect: segment %s holds no demo summary\n", name);
         status = 1;
-    } else if (walk_records(summary, &records, &recordBytes) != 0 || count_free(header, &freeBytes) != 0) {
+    } else if (walk_records(summary, &records, &record_bytes) != 0 || count_free(header, &free_bytes) != 0) {
         fprintf(stderr, "qorbu-demo --inspect: segment %s is inconsistent\n", name);
         status = 1;
     } else {
         printf("records %u bytes %llu record-bytes %llu free %u pid %d\n", records,
-               (unsigned long long)summary->bytesEchoed, recordBytes, freeBytes, (int)summary->pid);
+               (unsigned long long)summary->bytes_echoed, record_bytes, free_bytes, (int)summary->pid);
     }
     ShmClose(segment);
     return status;
