@@ -62,13 +62,13 @@ static const struct option kOptions[] = {
 static const struct {
     unsigned long standard, self_test, min, max;
 } kNumeric[kNumericCount] = {
-    {7007, 0, 0, 65535},
-    {1161, 0, 0, 65535},
-    {DEMO_SEGMENT_SIZE, DEMO_SEGMENT_SIZE, 4096, 0x40000000ul},
-    {DEMO_SEGMENT_ADDRESS, DEMO_SEGMENT_ADDRESS, 4096, UINTPTR_MAX},
-    {5000, 500, 10, 3600000},
-    {8, 8, 1, 500},
-    {64, 64, 1, 100000},
+    {7007, 0, 0, 65535},                                              /* port */
+    {1161, 0, 0, 65535},                                              /* snmp-port */
+    {DEMO_SEGMENT_SIZE, DEMO_SEGMENT_SIZE, 4096, 0x40000000ul},       /* segment-size */
+    {DEMO_SEGMENT_ADDRESS, DEMO_SEGMENT_ADDRESS, 4096, UINTPTR_MAX}, /* segment-address */
+    {5000, 500, 10, 3600000},                                         /* status-interval */
+    {8, 8, 1, 500},                                                   /* clients */
+    {64, 64, 1, 100000},                                              /* rounds */
 };
 
 /* 0: run; 1: done (help printed); -1: bad command line. */
@@ -139,7 +139,7 @@ static int create_segment(Demo *demo) {
     if (!demo->segment && errno == EEXIST) { /* the library never maps over memory in use */
         ShmUnlink(options->segment_name);        /* the object it made stays unsized: remove it */
         fprintf(stderr, "qorbu-demo: the address range at %#lx is in use; choose --segment-address\n",
-                (unsigned long)(options->segment_address - (uintptr_t)ShmOverhead()));
+                options->segment_address - (unsigned long)ShmOverhead());
         return -1;
     }
     if (!demo->segment) {
