@@ -30,23 +30,26 @@ extern "C" {
 typedef void (*HostTaskFn)(void *arg);
 
 /* The four timed lists, in the order the select loop consults them. */
-typedef enum HostList { HOST_LIST_URGENT, HOST_LIST_NORMAL, HOST_LIST_LOW, HOST_LIST_IDLE, HOST_LIST_COUNT } HostList;
+typedef enum HostList {
+    HOST_LIST_URGENT,
+    HOST_LIST_NORMAL,
+    HOST_LIST_LOW,
+    HOST_LIST_IDLE,
+    HOST_LIST_COUNT
+} HostList;
 
-/* A timed task. The link must come first: the select loop reads the first
- * task of each list as a SelHostTask (its due time). */
-typedef struct HostTimed {
-    SelHostTask link;
-    HostTaskFn fn;
-    void *arg;
-    int list;
-} HostTimed;
-
-/* What travels through the loop's 36-byte task record, and what a watched
- * descriptor queues. */
+/* What travels through the loop's 36-byte task record. */
 typedef struct HostTaskRecord {
     HostTaskFn fn;
     void *arg;
 } HostTaskRecord;
+
+/* A timed task. The link comes first: the loop reads it as a SelHostTask. */
+typedef struct HostTimed {
+    SelHostTask link;
+    HostTaskFn fn;
+    void *arg;
+} HostTimed;
 
 typedef struct HostQueued {
     struct HostQueued *next;
@@ -57,11 +60,8 @@ typedef struct HostQueued {
 typedef struct HostContext {
     SelHostContext selector;
     SelHostScheduler scheduler;
-    HostQueued *queueHead;
-    HostQueued *queueTail;
+    HostQueued *queue_head, *queue_tail;
     HostTaskRecord watches[FD_SETSIZE];
-    uint32_t timedDue;   /* timed tasks moved to the queue */
-    uint32_t watchesFired;
 } HostContext;
 
 void host_init(HostContext *host);
@@ -70,18 +70,15 @@ void host_destroy(HostContext *host);
 /* Queues fn(arg) to run at the next drain of the select loop. 0 or -1. */
 int host_post(HostContext *host, HostTaskFn fn, void *arg);
 /* Runs fn(arg) from the given list once ms milliseconds have passed on the
- * host clock. The result identifies the task for host_cancel; NULL when out
- * of memory. Equal due times keep their order of arrival. */
+ * host clock; equal due times keep their order of arrival. The result is
+ * for host_cancel; NULL when out of memory or for a bad list. */
 HostTimed *host_after(HostContext *host, HostList list, unsigned int ms, HostTaskFn fn, void *arg);
-/* Removes a timed task that has not been queued yet; returns 1 if it was
- * still waiting, 0 otherwise (the handle is then no longer valid). */
+/* 1 if the task was still waiting (it is then freed), 0 otherwise. */
 int host_cancel(HostContext *host, HostTimed *task);
-/* Watches a descriptor (below FD_SETSIZE) for readability: each pass in
- * which it is readable queues fn(arg). 0, or -1 with errno EINVAL. */
+/* Each pass in which fd (below FD_SETSIZE) is readable queues fn(arg).
+ * 0, or -1 with errno EINVAL. */
 int host_watch_fd(HostContext *host, int fd, HostTaskFn fn, void *arg);
-void host_unwatch_fd(HostContext *host, int fd);
-/* The host clock: CLOCK_MONOTONIC as a timeval. */
-struct timeval host_now(void);
+/* t + ms on the host clock (pal_time_tzcurrent: CLOCK_MONOTONIC). */
 struct timeval host_timeval_add_ms(struct timeval t, unsigned int ms);
 
 /* ---- the shared segment ------------------------------------------------------
@@ -96,35 +93,35 @@ struct timeval host_timeval_add_ms(struct timeval t, unsigned int ms);
 /* Lives at ShmMetadata(handle, sizeof(DemoSummary)). */
 typedef struct DemoSummary {
     uint32_t magic;
-    int32_t pid;              /* the daemon that owns the segment */
-    uint32_t openConnections; /* records in the list */
-    uint32_t acceptedTotal;
-    uint64_t bytesEchoed;     /* over all connections, closed ones included */
-    uintptr_t records;        /* address of the newest record, 0 when none */
+    int32_t pid;               /* the daemon that owns the segment */
+    uint32_t open_connections; /* records in the list */
+    uint32_t accepted_total;
+    uint64_t bytes_echoed;     /* over all connections, closed ones included */
+    uintptr_t records;         /* address of the newest record, 0 when none */
 } DemoSummary;
 
 /* One per open connection, in the data area. */
 typedef struct DemoConnection {
     uint32_t magic;
     int32_t fd;
-    uint32_t peerPort;
-    uint32_t serial;          /* 1 for the first connection accepted */
-    uint64_t bytesEchoed;
-    uintptr_t next;           /* older record, 0 at the end */
-    uintptr_t prev;           /* newer record, 0 at the head */
+    uint32_t peer_port;
+    uint32_t serial;           /* 1 for the first connection accepted */
+    uint64_t bytes_echoed;
+    uintptr_t next;            /* older record, 0 at the end */
+    uintptr_t prev;            /* newer record, 0 at the head */
 } DemoConnection;
 
-/* Default segment geometry: a fixed address that a fresh process is not
- * likely to use, so a second process can map the segment there too. */
+/* The default data area address: one a fresh process is not likely to use,
+ * so a second process can map the segment there too. */
 #if UINTPTR_MAX == 0xffffffffu
-#define DEMO_SEGMENT_ADDRESS ((uintptr_t)0x30001000u)
+#define DEMO_SEGMENT_ADDRESS 0x30001000ul
 #else
-#define DEMO_SEGMENT_ADDRESS ((uintptr_t)0x5a0000001000u)
+#define DEMO_SEGMENT_ADDRESS 0x5a0000001000ul
 #endif
-#define DEMO_SEGMENT_SIZE (1u << 20)
+#define DEMO_SEGMENT_SIZE (1ul << 20)
 
-/* The second process (qorbu-demo --inspect NAME): its exit status, 0 after
- * printing the one-line report. */
+/* The second process (qorbu-demo --inspect NAME): prints one line and
+ * returns the exit status. */
 int inspect_segment(const char *name);
 
 /* ---- the echo service ----------------------------------------------------------
@@ -133,16 +130,14 @@ int inspect_segment(const char *name);
 typedef struct EchoService {
     ShmHandle *segment;
     DemoSummary *summary;
-    int listenFd;
+    int listen_fd;
     struct sockaddr_in address; /* where it listens */
     int stopping;
-    uint32_t refusedForSpace;   /* connections closed for lack of segment space */
-    Greenthread *idleWaiter;    /* woken when the last connection has closed */
+    Greenthread *idle_waiter;   /* woken when the last connection has closed */
 } EchoService;
 
 /* Listens on 127.0.0.1:port (0: any free port) and starts the accepting
- * green thread. The segment's metadata area must hold an initialised
- * DemoSummary. 0, or -1 after a message on standard error. */
+ * green thread; summary must be initialised. 0, or -1 after a message. */
 int echo_start(EchoService *svc, ShmHandle *segment, DemoSummary *summary, unsigned int port);
 /* Stops accepting and ends every connection; the green threads finish on
  * their own during the next passes of the loop. */
@@ -151,41 +146,31 @@ void echo_stop(EchoService *svc);
 void echo_wait_idle(EchoService *svc);
 
 /* ---- the SNMP agent --------------------------------------------------------------
- * An in-process Net-SNMP master agent on one loopback UDP port. It reads no
- * configuration or persistent files, answers the community "public" from
- * 127.0.0.1 only, and is serviced by the selector's select loop
- * (snmp_select_info, snmp_read, snmp_timeout, run_alarms): it opens no
- * thread and sets no signal handler of its own. */
+ * An in-process Net-SNMP master agent on one loopback UDP port, answering the
+ * community "public" from 127.0.0.1, serviced by the selector's select loop:
+ * no thread, no signal handler, no system configuration or state files. */
 
-/* The scalars, under netSnmpPlaypen (1.3.6.1.4.1.8072.9999.9999), for local
- * experiments; each is the instance .0 of these objects. */
+/* The scalars, instances .0 under netSnmpPlaypen (1.3.6.1.4.1.8072.9999.9999). */
 #define DEMO_OID_BASE "1.3.6.1.4.1.8072.9999.9999.7"
-#define DEMO_OID_OPEN_CONNECTIONS DEMO_OID_BASE ".1.0"   /* Gauge32 */
-#define DEMO_OID_BYTES_ECHOED DEMO_OID_BASE ".2.0"       /* Counter64 */
-#define DEMO_OID_SEGMENT_FREE DEMO_OID_BASE ".3.0"       /* Gauge32 */
+#define DEMO_OID_OPEN_CONNECTIONS DEMO_OID_BASE ".1.0" /* Gauge32 */
+#define DEMO_OID_BYTES_ECHOED DEMO_OID_BASE ".2.0"     /* Counter64 */
+#define DEMO_OID_SEGMENT_FREE DEMO_OID_BASE ".3.0"     /* Gauge32 */
 
-/* Starts the agent on udp:127.0.0.1:port, keeping Net-SNMP's state in
- * stateDir (an empty private directory); the scalars' values are read from
- * the segment and its summary at every request. 0, or -1 after a message on
- * standard error. */
-int agent_start(ShmHandle *segment, const DemoSummary *summary, unsigned int port, const char *stateDir);
+/* Starts the agent on udp:127.0.0.1:*port (0: a free port, stored there),
+ * with Net-SNMP's state in a private directory; the values are read from
+ * the segment at every request. 0, or -1 after a message. */
+int agent_start(ShmHandle *segment, const DemoSummary *summary, unsigned int *port);
+/* Shuts down what agent_start set up and removes the directory. */
 void agent_stop(void);
-/* A UDP port on 127.0.0.1 that was free a moment ago, or 0. */
-unsigned int agent_pick_free_port(void);
 
 /* ---- the daemon ------------------------------------------------------------------ */
 
 typedef struct DemoOptions {
-    int selfTest;
-    unsigned int clients;         /* self-test client green threads */
-    unsigned int rounds;          /* echo round trips per client */
-    unsigned int port;            /* echo port; 0: any free port */
-    unsigned int snmpPort;        /* SNMP agent port; 0: any free port */
-    const char *segmentName;
-    uint32_t segmentSize;
-    uintptr_t segmentAddress;     /* data area address given to ShmCreate */
-    unsigned int statusIntervalMs;
-    const char *inspect;          /* --inspect NAME: the second-process reader */
+    int self_test;
+    const char *segment_name;
+    const char *inspect; /* --inspect NAME: run as the second process */
+    unsigned long port, snmp_port, segment_size, segment_address, status_interval_ms;
+    unsigned long clients, rounds; /* self-test client green threads, round trips of each */
 } DemoOptions;
 
 typedef struct SelfTest SelfTest;
@@ -196,21 +181,18 @@ typedef struct Demo {
     HostContext host;
     ShmHandle *segment;
     DemoSummary *summary;
-    uint32_t freeAtStart;
+    uint32_t free_at_start;
     EchoService echo;
-    SelTimer statusTimer;
-    uint32_t statusLines;
-    int signalPipe[2];
-    char stateDir[64];
-    unsigned int snmpPort;
+    SelTimer status_timer;
+    int signal_pipe[2];
+    unsigned int snmp_port;
     struct timespec started;
     int stopping;
-    SelfTest *selfTest;
+    SelfTest *test;
 } Demo;
 
 /* Queues the orderly stop as a host task; safe to call more than once. */
 void demo_request_stop(Demo *demo, const char *reason);
-/* Seconds since a monotonic time stamp. */
 double demo_seconds_since(const struct timespec *since);
 
 /* ---- the self-test -----------------------------------------------------------------
@@ -218,11 +200,8 @@ double demo_seconds_since(const struct timespec *since);
  * against its own agent, a second process reading the segment, a summary on
  * standard output and a verdict. */
 
-/* Everything the self-test must finish within, shutdown included. */
-#define SELFTEST_DEADLINE_MS 25000
-
-/* Starts the controller and the clients (green threads) and arms the
- * deadline on the host scheduler. NULL after a message on failure. */
+/* Starts the controller and the clients and arms a deadline on the host
+ * scheduler. NULL after a message on failure. */
 SelfTest *selftest_start(Demo *demo);
 /* The daemon is stopping: ends the clients early (the verdict is then a
  * failure unless the self-test had already finished). */

@@ -5,46 +5,50 @@
 #include <errno.h>
 #include <fcntl.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
-#include <unistd.h>
 
 #include "demo.h"
 
-enum { kSizeClasses = 27, kSmallestBlock = 8 };
-
-/* Free bytes counted by walking the free lists without taking the segment
- * lock: for read-only handles, at moments when nobody allocates or frees.
- * Returns 0 and sets *freeBytes, or -1 if a list leaves the data area. */
-static int count_free(const ShmHeader *header, uint32_t *freeBytes) {
-    const uintptr_t dataStart = header->base + (uintptr_t)getpagesize();
-    const uintptr_t dataEnd = header->base + header->size;
-    const uintptr_t maxBlocks = (dataEnd - dataStart) / kSmallestBlock;
-    uint32_t total = 0;
-    for (int k = 0; k < kSizeClasses; ++k) {
-        const uint32_t blockSize = (uint32_t)kSmallestBlock << k;
-        uintptr_t steps = 0;
-        for (uintptr_t block = header->freeList[k]; block; block = *(const uintptr_t *)block) {
-            if (block < dataStart || block >= dataEnd || ++steps > maxBlocks)
-                return -1;
-            total += blockSize;
-        }
+/* Free bytes, summed from ShmPrintFree's dump ("0x%08x [k] = { addr, ... }",
+ * one line per class). It takes no lock, so it serves a read-only handle at
+ * moments when nobody allocates or frees. -1 when a list is damaged (the
+ * walker sets errno and stops there) or the dump is cut short. */
+static long long count_free(ShmHandle *segment) {
+    char *dump = NULL;
+    size_t size = 0;
+    FILE *out = open_memstream(&dump, &size);
+    if (!out)
+        return -1;
+    errno = 0;
+    ShmPrintFree(out, segment->base);
+    int damaged = errno != 0 || ferror(out);
+    damaged |= fclose(out) != 0;
+    long long total = 0;
+    unsigned int block, lines = 0;
+    char *save = NULL;
+    for (char *line = strtok_r(dump, "\n", &save); line && !damaged; line = strtok_r(NULL, "\n", &save)) {
+        ++lines;
+        const char *list = strchr(line, '{');
+        damaged = !list || sscanf(line, "0x%x", &block) != 1;
+        for (const char *at = list; !damaged && (at = strstr(at + 1, "0x"));)
+            total += block;
     }
-    *freeBytes = total;
-    return 0;
+    free(dump);
+    const unsigned int classes = sizeof segment->base->freeList / sizeof segment->base->freeList[0];
+    return damaged || lines != classes ? -1 : total;
 }
 
 static int walk_records(const DemoSummary *summary, unsigned int *records, unsigned long long *bytes) {
-    unsigned int count = 0;
-    unsigned long long total = 0;
+    *records = 0;
+    *bytes = 0;
     for (uintptr_t at = summary->records; at; at = ((const DemoConnection *)at)->next) {
         const DemoConnection *record = (const DemoConnection *)at;
-        if (record->magic != DEMO_RECORD_MAGIC || count > summary->openConnections)
+        if (record->magic != DEMO_RECORD_MAGIC || *records > summary->open_connections)
             return -1;
-        ++count;
-        total += record->bytesEchoed;
+        ++*records;
+        *bytes += record->bytes_echoed;
     }
-    *records = count;
-    *bytes = total;
     return 0;
 }
 
@@ -54,22 +58,19 @@ int inspect_segment(const char *name) {
         fprintf(stderr, "qorbu-demo --inspect: cannot open segment %s: %s\n", name, strerror(errno));
         return 1;
     }
-    const ShmHeader *header = (const ShmHeader *)((char *)ShmAddr(segment) - ShmOverhead());
     const DemoSummary *summary = ShmMetadata(segment, sizeof(DemoSummary));
-    unsigned int records = 0;
-    unsigned long long recordBytes = 0;
-    uint32_t freeBytes = 0;
-    int status = 0;
-    if (!summary || summary->magic != DEMO_SUMMARY_MAGIC) {
+    unsigned int records;
+    unsigned long long record_bytes;
+    long long free_bytes = 0;
+    int status = 1;
+    if (!summary || summary->magic != DEMO_SUMMARY_MAGIC)
         fprintf(stderr, "qorbu-demo --inspect: segment %s holds no demo summary\n", name);
-        status = 1;
-    } else if (walk_records(summary, &records, &recordBytes) != 0 || count_free(header, &freeBytes) != 0) {
+    else if (walk_records(summary, &records, &record_bytes) != 0 || (free_bytes = count_free(segment)) < 0)
         fprintf(stderr, "qorbu-demo --inspect: segment %s is inconsistent\n", name);
-        status = 1;
-    } else {
-        printf("records %u bytes %llu record-bytes %llu free %u pid %d\n", records,
-               (unsigned long long)summary->bytesEchoed, recordBytes, freeBytes, (int)summary->pid);
-    }
+    else
+        status = printf("records %u bytes %llu record-bytes %llu free %lld pid %d\n", records,
+                        (unsigned long long)summary->bytes_echoed, record_bytes, free_bytes,
+                        (int)summary->pid) < 0;
     ShmClose(segment);
     return status;
 }

@@ -7,7 +7,6 @@
 #include <arpa/inet.h>
 #include <errno.h>
 #include <fcntl.h>
-#include <ftw.h>
 #include <getopt.h>
 #include <signal.h>
 #include <stdio.h>
@@ -18,45 +17,19 @@
 
 #include "demo.h"
 
-enum {
-    kExitOk = 0,
-    kExitFailure = 1,
-    kExitUsage = 2,
-    kDefaultPort = 7007,
-    kDefaultSnmpPort = 1161,
-    kDefaultStatusMs = 5000,
-    kSelfTestStatusMs = 500,
-    kDefaultClients = 8,
-    kDefaultRounds = 64,
-    kMaxClients = 500,
-    kStopGraceMs = 5000,
-};
+enum { kExitOk, kExitFailure, kExitUsage };
+enum { kStopGraceMs = 5000 }; /* connections get this long to close after a stop */
 
 static const char kUsage[] =
-    "usage: qorbu-demo [options]\n"
-    "       qorbu-demo --self-test [--clients N] [--rounds N] [options]\n"
-    "\n"
-    "A host daemon on libqorbu: TCP echo on 127.0.0.1 in green threads, an SNMP\n"
-    "agent on udp:127.0.0.1, per-connection records in a shared segment, a status\n"
-    "line on standard error. SIGINT or SIGTERM stops it (exit status 0).\n"
-    "\n"
-    "  --port N              echo port (default 7007; self-test: any free port)\n"
-    "  --snmp-port N         SNMP agent port (default 1161; self-test: any free port)\n"
-    "  --segment NAME        shared segment name (default qorbu-demo;\n"
-    "                        self-test: qorbu-demo-selftest-PID)\n"
-    "  --segment-size BYTES  data bytes of the segment (default 1048576)\n"
-    "  --segment-address A   data area address, a multiple of 4096 (hex with 0x)\n"
-    "  --status-interval MS  period of the status line (default 5000; self-test 500)\n"
-    "  --self-test           run clients, snmpget and a second process, print a\n"
-    "                        summary and exit 0 only when every check held\n"
-    "  --clients N           self-test client green threads (default 8, at most 500)\n"
-    "  --rounds N            echo round trips per client (default 64)\n"
-    "  --help                this text\n"
-    "\n"
-    "Exit status: 0 success, 1 failure (start-up or a failed self-test check),\n"
-    "2 bad command line.\n";
+    "usage: qorbu-demo [--port N] [--snmp-port N] [--segment NAME] [--segment-size BYTES]\n"
+    "                  [--segment-address A] [--status-interval MS]\n"
+    "       qorbu-demo --self-test [--clients N] [--rounds N] [options above]\n"
+    "       qorbu-demo --inspect NAME\n"
+    "A host daemon on libqorbu: TCP echo on 127.0.0.1 in green threads, an SNMP agent, per-connection\n"
+    "records in a shared segment. SIGINT or SIGTERM stops it. Exit status: 0 success, 1 failure (at\n"
+    "start-up or a failed self-test check), 2 bad command line. Details: docs/demo.md.\n";
 
-static volatile sig_atomic_t signalWritePipe = -1;
+static volatile sig_atomic_t signal_write_fd = -1;
 
 double demo_seconds_since(const struct timespec *since) {
     struct timespec now;
@@ -66,94 +39,85 @@ double demo_seconds_since(const struct timespec *since) {
 
 /* ---- options -------------------------------------------------------------- */
 
-/* The numeric options come first: their ids index kNumeric. */
-enum OptionId {
-    OPT_PORT = 1000, OPT_SNMP_PORT, OPT_SEGMENT_SIZE, OPT_SEGMENT_ADDRESS, OPT_STATUS, OPT_CLIENTS, OPT_ROUNDS,
-    OPT_SEGMENT, OPT_SELF_TEST, OPT_INSPECT, OPT_HELP
-};
+/* The numeric options come first: getopt_long returns their index, which
+ * indexes kNumeric and the fields in parse_options too. */
+enum { kNumericCount = 7 };
 
 static const struct option kOptions[] = {
-    {"port", required_argument, NULL, OPT_PORT},
-    {"snmp-port", required_argument, NULL, OPT_SNMP_PORT},
-    {"segment-size", required_argument, NULL, OPT_SEGMENT_SIZE},
-    {"segment-address", required_argument, NULL, OPT_SEGMENT_ADDRESS},
-    {"status-interval", required_argument, NULL, OPT_STATUS},
-    {"clients", required_argument, NULL, OPT_CLIENTS},
-    {"rounds", required_argument, NULL, OPT_ROUNDS},
-    {"segment", required_argument, NULL, OPT_SEGMENT},
-    {"self-test", no_argument, NULL, OPT_SELF_TEST},
-    {"inspect", required_argument, NULL, OPT_INSPECT},
-    {"help", no_argument, NULL, OPT_HELP},
+    {"port", required_argument, NULL, 0},
+    {"snmp-port", required_argument, NULL, 1},
+    {"segment-size", required_argument, NULL, 2},
+    {"segment-address", required_argument, NULL, 3},
+    {"status-interval", required_argument, NULL, 4},
+    {"clients", required_argument, NULL, 5},
+    {"rounds", required_argument, NULL, 6},
+    {"segment", required_argument, NULL, 'g'},
+    {"self-test", no_argument, NULL, 's'},
+    {"inspect", required_argument, NULL, 'i'},
+    {"help", no_argument, NULL, 'h'},
     {NULL, 0, NULL, 0},
 };
 
 /* Default, self-test default, least and greatest value of each numeric option. */
 static const struct {
-    unsigned long long standard, selfTest, min, max;
-} kNumeric[OPT_SEGMENT - OPT_PORT] = {
-    {kDefaultPort, 0, 0, 65535},
-    {kDefaultSnmpPort, 0, 0, 65535},
-    {DEMO_SEGMENT_SIZE, DEMO_SEGMENT_SIZE, 4096, 0x40000000u},
-    {DEMO_SEGMENT_ADDRESS, DEMO_SEGMENT_ADDRESS, 4096, UINTPTR_MAX},
-    {kDefaultStatusMs, kSelfTestStatusMs, 10, 3600000},
-    {kDefaultClients, kDefaultClients, 1, kMaxClients},
-    {kDefaultRounds, kDefaultRounds, 1, 100000},
+    unsigned long standard, self_test, min, max;
+} kNumeric[kNumericCount] = {
+    {7007, 0, 0, 65535},                                              /* port */
+    {1161, 0, 0, 65535},                                              /* snmp-port */
+    {DEMO_SEGMENT_SIZE, DEMO_SEGMENT_SIZE, 4096, 0x40000000ul},       /* segment-size */
+    {DEMO_SEGMENT_ADDRESS, DEMO_SEGMENT_ADDRESS, 4096, UINTPTR_MAX}, /* segment-address */
+    {5000, 500, 10, 3600000},                                         /* status-interval */
+    {8, 8, 1, 500},                                                   /* clients */
+    {64, 64, 1, 100000},                                              /* rounds */
 };
 
 /* 0: run; 1: done (help printed); -1: bad command line. */
-static int parse_options(int argc, char **argv, DemoOptions *options, char *nameBuffer, size_t nameSize) {
-    enum { kCount = OPT_SEGMENT - OPT_PORT };
-    unsigned long long value[kCount];
-    int given[kCount] = {0}, option;
-    *options = (DemoOptions){.segmentName = NULL};
+static int parse_options(int argc, char **argv, DemoOptions *options) {
+    static char self_test_name[64];
+    unsigned long *const field[kNumericCount] = {&options->port, &options->snmp_port, &options->segment_size,
+                                                 &options->segment_address, &options->status_interval_ms,
+                                                 &options->clients, &options->rounds};
+    int given[kNumericCount] = {0}, option;
     opterr = 0;
     while ((option = getopt_long(argc, argv, "h", kOptions, NULL)) != -1) {
-        const int k = option - OPT_PORT;
         char *end;
         switch (option) {
-        case OPT_SELF_TEST: options->selfTest = 1; break;
-        case OPT_SEGMENT: options->segmentName = optarg; break;
-        case OPT_INSPECT: options->inspect = optarg; break;
-        case OPT_HELP:
+        case 's': options->self_test = 1; break;
+        case 'g': options->segment_name = optarg; break;
+        case 'i': options->inspect = optarg; break;
         case 'h': fputs(kUsage, stdout); return 1;
         case '?':
-            fprintf(stderr, "qorbu-demo: unknown option or missing value: %s (try --help)\n", argv[optind - 1]);
+            fprintf(stderr, "qorbu-demo: unknown option or missing value: %s (try --help)\n",
+                    argv[optind - 1]);
             return -1;
         default:
             errno = 0;
-            value[k] = strtoull(optarg, &end, 0);
-            if (errno != 0 || end == optarg || *end != '\0' || optarg[0] == '-' || value[k] < kNumeric[k].min ||
-                value[k] > kNumeric[k].max) {
-                fprintf(stderr, "qorbu-demo: --%s wants a number from %llu to %llu, not '%s'\n", kOptions[k].name,
-                        kNumeric[k].min, kNumeric[k].max, optarg);
+            *field[option] = strtoul(optarg, &end, 0);
+            if (errno != 0 || end == optarg || *end != '\0' || optarg[0] == '-' ||
+                *field[option] < kNumeric[option].min || *field[option] > kNumeric[option].max) {
+                fprintf(stderr, "qorbu-demo: --%s wants a number from %lu to %lu, not '%s'\n",
+                        kOptions[option].name, kNumeric[option].min, kNumeric[option].max, optarg);
                 return -1;
             }
-            given[k] = 1;
+            given[option] = 1;
         }
     }
     if (optind < argc) {
         fprintf(stderr, "qorbu-demo: unexpected argument '%s' (try --help)\n", argv[optind]);
         return -1;
     }
-    for (int k = 0; k < kCount; ++k)
+    for (int k = 0; k < kNumericCount; ++k)
         if (!given[k])
-            value[k] = options->selfTest ? kNumeric[k].selfTest : kNumeric[k].standard;
-    options->port = (unsigned int)value[OPT_PORT - OPT_PORT];
-    options->snmpPort = (unsigned int)value[OPT_SNMP_PORT - OPT_PORT];
-    options->segmentSize = (uint32_t)value[OPT_SEGMENT_SIZE - OPT_PORT];
-    options->segmentAddress = (uintptr_t)value[OPT_SEGMENT_ADDRESS - OPT_PORT];
-    options->statusIntervalMs = (unsigned int)value[OPT_STATUS - OPT_PORT];
-    options->clients = (unsigned int)value[OPT_CLIENTS - OPT_PORT];
-    options->rounds = (unsigned int)value[OPT_ROUNDS - OPT_PORT];
-    if (options->segmentAddress % 4096 != 0) {
+            *field[k] = options->self_test ? kNumeric[k].self_test : kNumeric[k].standard;
+    if (options->segment_address % 4096 != 0) {
         fprintf(stderr, "qorbu-demo: --segment-address must be a multiple of 4096\n");
         return -1;
     }
-    if (!options->segmentName && options->selfTest) {
-        snprintf(nameBuffer, nameSize, "qorbu-demo-selftest-%d", (int)getpid());
-        options->segmentName = nameBuffer;
-    } else if (!options->segmentName) {
-        options->segmentName = "qorbu-demo";
+    if (!options->segment_name && options->self_test) {
+        snprintf(self_test_name, sizeof self_test_name, "qorbu-demo-selftest-%d", (int)getpid());
+        options->segment_name = self_test_name;
+    } else if (!options->segment_name) {
+        options->segment_name = "qorbu-demo";
     }
     return 0;
 }
@@ -163,79 +127,39 @@ static int parse_options(int argc, char **argv, DemoOptions *options, char *name
 static int create_segment(Demo *demo) {
     const DemoOptions *options = &demo->options;
     char object[256];
-    snprintf(object, sizeof object, "/%s", options->segmentName);
+    snprintf(object, sizeof object, "/%s", options->segment_name);
     int fd = shm_open(object, O_RDONLY, 0);
     if (fd >= 0) {
         close(fd);
         fprintf(stderr, "qorbu-demo: segment %s already exists (another qorbu-demo? remove it with "
-                        "'qorbu-shm unlink %s')\n", options->segmentName, options->segmentName);
+                        "'qorbu-shm unlink %s')\n", options->segment_name, options->segment_name);
         return -1;
     }
-    demo->segment = ShmCreate(options->segmentName, (void *)options->segmentAddress, options->segmentSize);
+    demo->segment = ShmCreate(options->segment_name, (void *)options->segment_address, options->segment_size);
     if (!demo->segment && errno == EEXIST) { /* the library never maps over memory in use */
-        ShmUnlink(options->segmentName);        /* the object it made stays unsized: remove it */
+        ShmUnlink(options->segment_name);        /* the object it made stays unsized: remove it */
         fprintf(stderr, "qorbu-demo: the address range at %#lx is in use; choose --segment-address\n",
-                (unsigned long)(options->segmentAddress - (uintptr_t)ShmOverhead()));
+                options->segment_address - (unsigned long)ShmOverhead());
         return -1;
     }
     if (!demo->segment) {
-        fprintf(stderr, "qorbu-demo: cannot create segment %s: %s\n", options->segmentName, strerror(errno));
+        fprintf(stderr, "qorbu-demo: cannot create segment %s: %s\n", options->segment_name, strerror(errno));
         return -1;
     }
     demo->summary = ShmMetadata(demo->segment, sizeof *demo->summary);
-    memset(demo->summary, 0, sizeof *demo->summary);
-    demo->summary->magic = DEMO_SUMMARY_MAGIC;
-    demo->summary->pid = (int32_t)getpid();
-    demo->freeAtStart = ShmTotalFree(demo->segment);
+    *demo->summary = (DemoSummary){.magic = DEMO_SUMMARY_MAGIC, .pid = (int32_t)getpid()};
+    demo->free_at_start = ShmTotalFree(demo->segment);
     return 0;
-}
-
-static void remove_segment(Demo *demo) {
-    if (!demo->segment)
-        return;
-    ShmClose(demo->segment);
-    demo->segment = NULL;
-    demo->summary = NULL;
-    ShmUnlink(demo->options.segmentName);
-}
-
-/* ---- the SNMP agent -------------------------------------------------------- */
-
-static int remove_entry(const char *path, const struct stat *st, int flag, struct FTW *ftw) {
-    (void)st, (void)flag, (void)ftw;
-    remove(path);
-    return 0;
-}
-
-static int start_agent(Demo *demo) {
-    strcpy(demo->stateDir, "/tmp/qorbu-demo-snmp-XXXXXX");
-    if (!mkdtemp(demo->stateDir)) {
-        perror("qorbu-demo: mkdtemp");
-        demo->stateDir[0] = '\0';
-        return -1;
-    }
-    /* snmpget, run by the self-test, reads its configuration from here. */
-    setenv("SNMPCONFPATH", demo->stateDir, 1);
-    setenv("SNMP_PERSISTENT_DIR", demo->stateDir, 1);
-    demo->snmpPort = demo->options.snmpPort ? demo->options.snmpPort : agent_pick_free_port();
-    return agent_start(demo->segment, demo->summary, demo->snmpPort, demo->stateDir);
-}
-
-static void stop_agent(Demo *demo) {
-    agent_stop();
-    if (demo->stateDir[0])
-        nftw(demo->stateDir, remove_entry, 8, FTW_DEPTH | FTW_PHYS);
 }
 
 /* ---- status line ---------------------------------------------------------- */
 
 static void log_status(Demo *demo) {
-    ++demo->statusLines;
     fprintf(stderr,
             "qorbu-demo: status: %u connections open, %u accepted, %llu bytes echoed, %u of %u segment "
             "bytes free, up %.1f s\n",
-            demo->summary->openConnections, demo->summary->acceptedTotal,
-            (unsigned long long)demo->summary->bytesEchoed, ShmTotalFree(demo->segment), demo->freeAtStart,
+            demo->summary->open_connections, demo->summary->accepted_total,
+            (unsigned long long)demo->summary->bytes_echoed, ShmTotalFree(demo->segment), demo->free_at_start,
             demo_seconds_since(&demo->started));
 }
 
@@ -243,7 +167,7 @@ static int on_status_timer(SelTimer *timer) {
     Demo *demo = timer->arg;
     log_status(demo);
     if (!demo->stopping)
-        SelSleep(timer, demo->options.statusIntervalMs);
+        SelSleep(timer, demo->options.status_interval_ms);
     return 0;
 }
 
@@ -260,10 +184,10 @@ static void stop_now(void *arg) {
     if (demo->stopping)
         return;
     demo->stopping = 1;
-    SelRemTimer(&demo->statusTimer);
+    SelRemTimer(&demo->status_timer);
     echo_stop(&demo->echo);
-    if (demo->selfTest)
-        selftest_stop(demo->selfTest);
+    if (demo->test)
+        selftest_stop(demo->test);
     host_after(&demo->host, HOST_LIST_URGENT, kStopGraceMs, on_stop_grace_expired, demo);
 }
 
@@ -276,9 +200,9 @@ void demo_request_stop(Demo *demo, const char *reason) {
 /* The handlers only note the signal in a pipe that the host scheduler
  * watches; the stop itself runs as a host task on the loop. */
 static void on_signal(int signo) {
-    int saved = errno;
-    unsigned char byte = (unsigned char)signo;
-    if (signalWritePipe >= 0 && write(signalWritePipe, &byte, 1) < 0) {
+    const int saved = errno;
+    const unsigned char byte = (unsigned char)signo;
+    if (write(signal_write_fd, &byte, 1) < 0) {
         /* the pipe is full: a stop is already pending */
     }
     errno = saved;
@@ -287,23 +211,21 @@ static void on_signal(int signo) {
 static void on_signal_pipe(void *arg) {
     Demo *demo = arg;
     unsigned char bytes[16];
-    ssize_t n = read(demo->signalPipe[0], bytes, sizeof bytes);
+    ssize_t n = read(demo->signal_pipe[0], bytes, sizeof bytes);
     if (n > 0)
         demo_request_stop(demo, bytes[n - 1] == SIGINT ? "SIGINT" : "SIGTERM");
 }
 
 static int install_signals(Demo *demo) {
-    if (pipe2(demo->signalPipe, O_CLOEXEC | O_NONBLOCK) != 0)
+    if (pipe2(demo->signal_pipe, O_CLOEXEC | O_NONBLOCK) != 0)
         return -1;
-    signalWritePipe = demo->signalPipe[1];
-    if (host_watch_fd(&demo->host, demo->signalPipe[0], on_signal_pipe, demo) != 0)
+    signal_write_fd = demo->signal_pipe[1];
+    if (host_watch_fd(&demo->host, demo->signal_pipe[0], on_signal_pipe, demo) != 0)
         return -1;
-    struct sigaction action;
-    memset(&action, 0, sizeof action);
-    action.sa_handler = on_signal;
-    sigemptyset(&action.sa_mask);
     /* No SA_RESTART: the select loop's wait returns with EINTR. The signals
      * stay blocked except during that wait (SelAddSignal). */
+    struct sigaction action = {.sa_handler = on_signal};
+    sigemptyset(&action.sa_mask);
     if (SelAddSignal(SIGINT) != 0 || SelAddSignal(SIGTERM) != 0 || sigaction(SIGINT, &action, NULL) != 0 ||
         sigaction(SIGTERM, &action, NULL) != 0)
         return -1;
@@ -324,38 +246,39 @@ static int start(Demo *demo) {
         perror("qorbu-demo: signals");
         return -1;
     }
-    if (create_segment(demo) != 0 || start_agent(demo) != 0)
+    demo->snmp_port = (unsigned int)demo->options.snmp_port;
+    if (create_segment(demo) != 0 || agent_start(demo->segment, demo->summary, &demo->snmp_port) != 0)
         return -1;
     /* After SelAddSignal: every green thread starts with the registered
      * signals blocked, like the main context. */
     greenthreads_init();
     if (echo_start(&demo->echo, demo->segment, demo->summary, demo->options.port) != 0)
         return -1;
-    demo->statusTimer.arg = demo;
-    demo->statusTimer.callback = on_status_timer;
-    SelSleep(&demo->statusTimer, demo->options.statusIntervalMs);
-    fprintf(stderr, "qorbu-demo: pid %d, echo on 127.0.0.1:%u, SNMP on udp:127.0.0.1:%u, segment %s (%u bytes free)\n",
-            (int)getpid(), (unsigned int)ntohs(demo->echo.address.sin_port), demo->snmpPort,
-            demo->options.segmentName, demo->freeAtStart);
-    if (demo->options.selfTest && !(demo->selfTest = selftest_start(demo)))
+    demo->status_timer = (SelTimer){.callback = on_status_timer, .arg = demo};
+    SelSleep(&demo->status_timer, demo->options.status_interval_ms);
+    fprintf(stderr, "qorbu-demo: pid %d, echo on 127.0.0.1:%u, SNMP on udp:127.0.0.1:%u, segment %s "
+                    "(%u bytes free)\n",
+            (int)getpid(), (unsigned int)ntohs(demo->echo.address.sin_port), demo->snmp_port,
+            demo->options.segment_name, demo->free_at_start);
+    if (demo->options.self_test && !(demo->test = selftest_start(demo)))
         return -1;
     return 0;
 }
 
 static void finish(Demo *demo) {
-    SelRemTimer(&demo->statusTimer);
-    if (demo->summary)
+    SelRemTimer(&demo->status_timer);
+    agent_stop();
+    if (demo->segment) {
         log_status(demo);
-    stop_agent(demo);
-    remove_segment(demo);
+        ShmClose(demo->segment);
+        ShmUnlink(demo->options.segment_name);
+    }
     host_destroy(&demo->host);
     SelSetZG(NULL);
-    signalWritePipe = -1;
 }
 
 static int run_daemon(Demo *demo) {
     SelGetTime(&demo->started);
-    demo->signalPipe[0] = demo->signalPipe[1] = -1;
     if (start(demo) != 0) {
         finish(demo);
         return kExitFailure;
@@ -363,11 +286,8 @@ static int run_daemon(Demo *demo) {
     /* Runs until the last green thread (the acceptor, the connections and
      * the self-test's threads) has finished. */
     greenthreads_run();
-    int status = kExitOk;
-    if (demo->selfTest && !selftest_passed(demo->selfTest))
-        status = kExitFailure;
-    selftest_free(demo->selfTest);
-    demo->selfTest = NULL;
+    const int status = demo->test && !selftest_passed(demo->test) ? kExitFailure : kExitOk;
+    selftest_free(demo->test);
     finish(demo);
     fprintf(stderr, "qorbu-demo: stopped\n");
     return status;
@@ -375,8 +295,7 @@ static int run_daemon(Demo *demo) {
 
 int main(int argc, char **argv) {
     static Demo demo;
-    char selfTestName[64];
-    int parsed = parse_options(argc, argv, &demo.options, selfTestName, sizeof selfTestName);
+    const int parsed = parse_options(argc, argv, &demo.options);
     if (parsed != 0)
         return parsed > 0 ? kExitOk : kExitUsage;
     if (demo.options.inspect)

@@ -106,7 +106,6 @@ TEST_F(HostSchedTest, OnlyDueTasksAreQueuedListByList)
     EXPECT_EQ(ran, (std::vector<std::string>{"urgent", "idle"}));
     EXPECT_EQ(host.scheduler.timed[HOST_LIST_URGENT], nullptr);
     EXPECT_NE(host.scheduler.timed[HOST_LIST_NORMAL], nullptr);
-    EXPECT_EQ(host.timedDue, 2u);
 }
 
 TEST_F(HostSchedTest, CancelRemovesOnlyWaitingTasks)
@@ -133,9 +132,6 @@ TEST_F(HostSchedTest, WatchedDescriptorQueuesItsTaskWhileReadable)
     EXPECT_EQ(thread_select_nb(&host), 1);
     EXPECT_EQ(drain(), 1);
     EXPECT_EQ(ran, std::vector<std::string>{"readable"});
-    host_unwatch_fd(&host, fds[0]);
-    EXPECT_EQ(host.scheduler.max_fd, -1);
-    EXPECT_EQ(thread_select_nb(&host), 0) << "unwatched descriptors are not looked at";
     EXPECT_EQ(host_watch_fd(&host, -1, record, nullptr), -1);
     EXPECT_EQ(host_watch_fd(&host, FD_SETSIZE, record, nullptr), -1);
     close(fds[0]);
@@ -196,7 +192,6 @@ TEST_F(HostSchedLoopTest, ReadableHostDescriptorIsServicedAtTheEndOfThePass)
     ASSERT_EQ(write(fds[1], "x", 1), 1);
     EXPECT_EQ(SelSelect(), 0);
     EXPECT_EQ(ran, std::vector<std::string>{"pipe"});
-    host_unwatch_fd(&host, fds[0]);
     close(fds[0]);
     close(fds[1]);
 }
