@@ -1,11 +1,11 @@
 /* The green-thread scheduler: one FIFO run queue for the process, cooperative
  * switches with swapcontext, and the run loop that falls back on the
  * selector when every green thread is blocked. */
-#include <errno.h>
-#include <signal.h>
-#include <stdio.h>
-#include <stdlib.h>
-#include <string.h>
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <unistd.h>
 
 #include "greenthreads/greenthread_private.h"

@@ -2,8 +2,8 @@
  * page inaccessible so that an overflow faults instead of corrupting the
  * memory below. Stacks are executable only when the process itself runs
  * with an executable stack. */
+#include <cstdio>
 #include <link.h>
-#include <stdio.h>
 #include <sys/mman.h>
 
 #include "greenthreads/greenthread_private.h"
