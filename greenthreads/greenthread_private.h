@@ -38,7 +38,7 @@ struct Greenthread {
     GreenthreadEntry entry;
     void *arg;
 #ifdef QORBU_GT_TSAN
-    void *tsanFiber;    /* ThreadSanitizer builds only */
+    void *tsan_fiber;   /* ThreadSanitizer builds only */
 #endif
 };
 

@@ -1,11 +1,11 @@
 /* The green-thread scheduler: one FIFO run queue for the process, cooperative
  * switches with swapcontext, and the run loop that falls back on the
  * selector when every green thread is blocked. */
-#include <errno.h>
-#include <signal.h>
-#include <stdio.h>
-#include <stdlib.h>
-#include <string.h>
+#include <cerrno>
+#include <csignal>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
 #include <unistd.h>
 
 #include "greenthreads/greenthread_private.h"
@@ -39,22 +39,22 @@ const void *main_stack_bottom;
 size_t main_stack_size;
 Greenthread *switched_from;
 
-void asan_leave(void **fakeStackSave, Greenthread *to)
+void asan_leave(void **fake_stack_save, Greenthread *to)
 {
     if (to == main_thread) {
-        __sanitizer_start_switch_fiber(fakeStackSave, main_stack_bottom, main_stack_size);
+        __sanitizer_start_switch_fiber(fake_stack_save, main_stack_bottom, main_stack_size);
         return;
     }
     const stack_t &stack = to->context.uc_stack;
-    __sanitizer_start_switch_fiber(fakeStackSave, static_cast<char *>(stack.ss_sp) + page_size,
+    __sanitizer_start_switch_fiber(fake_stack_save, static_cast<char *>(stack.ss_sp) + page_size,
                                    stack.ss_size - static_cast<size_t>(page_size));
 }
 
-void asan_arrive(void *fakeStackSave)
+void asan_arrive(void *fake_stack_save)
 {
     const void *bottom = nullptr;
     size_t size = 0;
-    __sanitizer_finish_switch_fiber(fakeStackSave, &bottom, &size);
+    __sanitizer_finish_switch_fiber(fake_stack_save, &bottom, &size);
     if (switched_from == main_thread && main_stack_size == 0) {
         main_stack_bottom = bottom;
         main_stack_size = size;
@@ -67,14 +67,14 @@ void asan_arrive(void *fakeStackSave)
 int switch_context(Greenthread *from, Greenthread *to, [[maybe_unused]] bool finishing)
 {
 #ifdef QORBU_GT_TSAN
-    __tsan_switch_to_fiber(to->tsanFiber, 0);
+    __tsan_switch_to_fiber(to->tsan_fiber, 0);
 #endif
 #ifdef QORBU_GT_ASAN
-    void *fakeStack = nullptr;
+    void *fake_stack = nullptr;
     switched_from = from;
-    asan_leave(finishing ? nullptr : &fakeStack, to);
+    asan_leave(finishing ? nullptr : &fake_stack, to);
     const int result = swapcontext(&from->context, &to->context);
-    asan_arrive(fakeStack);
+    asan_arrive(fake_stack);
     return result;
 #else
     return swapcontext(&from->context, &to->context);
@@ -92,8 +92,8 @@ void prepare_tsan_fiber([[maybe_unused]] Greenthread *thread, [[maybe_unused]] b
 {
 #ifdef QORBU_GT_TSAN
     if (reused)
-        __tsan_destroy_fiber(thread->tsanFiber);
-    thread->tsanFiber = __tsan_create_fiber(0);
+        __tsan_destroy_fiber(thread->tsan_fiber);
+    thread->tsan_fiber = __tsan_create_fiber(0);
 #endif
 }
 
@@ -120,13 +120,13 @@ void run_queue_push_front(Greenthread *thread)
 
 /* A failed switch leaves the caller running and runnable, and the record it
  * meant to resume back at the head of the queue. */
-void undo_switch(Greenthread *self, Greenthread *next, Greenthread *tailBefore, bool selfQueued)
+void undo_switch(Greenthread *self, Greenthread *next, Greenthread *tail_before, bool self_queued)
 {
     fprintf(stderr, "swapcontext() failed: %s\n", strerror(errno));
-    if (selfQueued) {
-        run_queue_tail = tailBefore;
-        if (tailBefore != nullptr)
-            tailBefore->next = nullptr;
+    if (self_queued) {
+        run_queue_tail = tail_before;
+        if (tail_before != nullptr)
+            tail_before->next = nullptr;
         else
             run_queue_head = nullptr;
     }
@@ -147,13 +147,13 @@ void switch_to_next(bool finishing)
         self->runnable = kRunnable;
         return;
     }
-    Greenthread *const tailBefore = run_queue_tail;
-    const bool selfQueued = self->runnable == kRunnable;
-    if (selfQueued)
+    Greenthread *const tail_before = run_queue_tail;
+    const bool self_queued = self->runnable == kRunnable;
+    if (self_queued)
         run_queue_append(self);
     current_thread = next;
     if (switch_context(self, next, finishing) != 0)
-        undo_switch(self, next, tailBefore, selfQueued);
+        undo_switch(self, next, tail_before, self_queued);
 }
 
 /* Every green thread waits: in epoll mode the pass sleeps until a
@@ -269,7 +269,7 @@ void greenthreads_init(void)
         return;
     self->runnable = kRunnable;
 #ifdef QORBU_GT_TSAN
-    self->tsanFiber = __tsan_get_current_fiber();
+    self->tsan_fiber = __tsan_get_current_fiber();
 #endif
     main_thread = self;
     current_thread = self;

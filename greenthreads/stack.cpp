@@ -2,8 +2,8 @@
  * page inaccessible so that an overflow faults instead of corrupting the
  * memory below. Stacks are executable only when the process itself runs
  * with an executable stack. */
+#include <cstdio>
 #include <link.h>
-#include <stdio.h>
 #include <sys/mman.h>
 
 #include "greenthreads/greenthread_private.h"
@@ -16,7 +16,7 @@ namespace qorbu::gt {
 namespace {
 
 struct StackFlagScan {
-    bool mainProgram = true; /* dl_iterate_phdr reports the program first */
+    bool main_program = true; /* dl_iterate_phdr reports the program first */
     bool executable = false;
 };
 
@@ -27,18 +27,18 @@ struct StackFlagScan {
 int scan_stack_flags(dl_phdr_info *info, size_t, void *data)
 {
     auto *scan = static_cast<StackFlagScan *>(data);
-    bool hasStackHeader = false;
+    bool has_stack_header = false;
     for (ElfW(Half) i = 0; i < info->dlpi_phnum; ++i) {
         const ElfW(Phdr) &header = info->dlpi_phdr[i];
         if (header.p_type != PT_GNU_STACK)
             continue;
-        hasStackHeader = true;
+        has_stack_header = true;
         if (header.p_flags & PF_X)
             scan->executable = true;
     }
-    if (scan->mainProgram && !hasStackHeader)
+    if (scan->main_program && !has_stack_header)
         scan->executable = true;
-    scan->mainProgram = false;
+    scan->main_program = false;
     return scan->executable ? 1 : 0;
 }
 
@@ -52,9 +52,9 @@ void register_with_valgrind([[maybe_unused]] char *low, [[maybe_unused]] char *h
 
 } // namespace
 
-size_t stack_mapping_length(long pageSize)
+size_t stack_mapping_length(long page_bytes)
 {
-    const size_t page = static_cast<size_t>(pageSize);
+    const size_t page = static_cast<size_t>(page_bytes);
     const size_t usable = (kStackSize + page - 1) / page * page;
     return usable + page;
 }

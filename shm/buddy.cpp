@@ -10,7 +10,7 @@
 
 namespace qorbu::shm {
 
-int classFor(uint32_t n) {
+int class_for(uint32_t n) {
     // A free block holds its link word, and its last word is the class word
     // of the block above it: on 64-bit targets an 8-byte block cannot hold
     // both, so requests start at class 1 there.
@@ -24,9 +24,9 @@ namespace {
 constexpr char kMismatchMessage[] = "ShmFree(): mismatched handle and pointer\n";
 constexpr char kDoubleFreeMessage[] = "ShmFree(): double-free\n";
 
-uintptr_t &nextOf(uintptr_t block) { return *reinterpret_cast<uintptr_t *>(block); }
+uintptr_t &next_of(uintptr_t block) { return *reinterpret_cast<uintptr_t *>(block); }
 
-int firstNonEmptyFrom(const ShmHeader *h, int k) {
+int first_non_empty_from(const ShmHeader *h, int k) {
     for (int j = k; j < kClassCount; j++) {
         if (h->freeList[j] != 0) return j;
     }
@@ -36,27 +36,27 @@ int firstNonEmptyFrom(const ShmHeader *h, int k) {
 /* Takes the highest block of class j and splits it down to class k: the
  * upper halves become the only members of the (empty) lists in between.
  * 0 when list j is damaged; nothing has changed then. */
-uintptr_t takeAndSplit(ShmHeader *h, int j, const ClassShape &shape, int k) {
+uintptr_t take_and_split(ShmHeader *h, int j, const ClassShape &shape, int k) {
     ListCursor cursor(h, j, shape);
     const uintptr_t block = cursor.entry();
     if (block != 0) cursor.advance();
     if (cursor.damaged()) return 0;
     h->freeList[j] = cursor.entry();
     for (int i = j - 1; i >= k; i--) {
-        const uintptr_t upper = block + blockSize(i);
-        nextOf(upper) = 0;
+        const uintptr_t upper = block + block_size(i);
+        next_of(upper) = 0;
         h->freeList[i] = upper;
     }
     return block;
 }
 
-void reportMismatch() {
+void report_mismatch() {
     const int saved = errno;
     fputs(kMismatchMessage, stderr);
     errno = saved;
 }
 
-[[noreturn]] void endOnDoubleFree(SegmentLock &lock) {
+[[noreturn]] void end_on_double_free(SegmentLock &lock) {
     // Other processes must still be able to use the segment.
     lock.release();
     fputs(kDoubleFreeMessage, stderr);
@@ -65,24 +65,24 @@ void reportMismatch() {
 
 /* Where p goes in list k: the link to rewrite and the neighbours. */
 struct ListPosition {
-    uintptr_t *link;       // the link that leads to the lower neighbour
-    uintptr_t *upperLink;  // the link that leads to the upper neighbour
-    uintptr_t upper;       // 0 when none
-    uintptr_t lower;       // 0 when none
+    uintptr_t *link;        // the link that leads to the lower neighbour
+    uintptr_t *upper_link;  // the link that leads to the upper neighbour
+    uintptr_t upper;        // 0 when none
+    uintptr_t lower;        // 0 when none
     bool damaged;
 };
 
 // Inlined: ShmFree's walk is on the hot path.
-[[gnu::always_inline]] inline ListPosition findPosition(ShmHeader *h, int k, const ClassShape &shape, uintptr_t p) {
+[[gnu::always_inline]] inline ListPosition find_position(ShmHeader *h, int k, const ClassShape &shape, uintptr_t p) {
     ListCursor cursor(h, k, shape);
-    uintptr_t *upperLink = nullptr;
+    uintptr_t *upper_link = nullptr;
     while (cursor.entry() > p) {
-        upperLink = cursor.link();
+        upper_link = cursor.link();
         cursor.advance();
     }
     // Past the head, the link that leads to the lower neighbour is the upper one's first word.
-    const uintptr_t upper = upperLink != nullptr ? reinterpret_cast<uintptr_t>(cursor.link()) : 0;
-    return {cursor.link(), upperLink, upper, cursor.entry(), cursor.damaged()};
+    const uintptr_t upper = upper_link != nullptr ? reinterpret_cast<uintptr_t>(cursor.link()) : 0;
+    return {cursor.link(), upper_link, upper, cursor.entry(), cursor.damaged()};
 }
 
 /* Inserts p, of class k, in its list and merges it upward while its
@@ -90,25 +90,25 @@ struct ListPosition {
  * writes the merged block's class word, which names the next class.
  * Returns 0, or kDamaged when a list on the way is damaged (p, or what it
  * merged into, is then in no list). */
-int insertAndMerge(const ShmHandle *handle, uintptr_t p, int k, SegmentLock &lock) {
+int insert_and_merge(const ShmHandle *handle, uintptr_t p, int k, SegmentLock &lock) {
     ShmHeader *h = handle->base;
     for (;; k++) {
-        const ListPosition pos = findPosition(h, k, shapeOf(handle, k), p);
+        const ListPosition pos = find_position(h, k, shape_of(handle, k), p);
         if (pos.damaged) return kDamaged;
-        if (pos.lower == p) endOnDoubleFree(lock);
-        nextOf(p) = pos.lower;
+        if (pos.lower == p) end_on_double_free(lock);
+        next_of(p) = pos.lower;
         *pos.link = p;
         if (k == kLargestClass) return 0;
-        const uintptr_t size = blockSize(k);
+        const uintptr_t size = block_size(k);
         if ((p & (2 * size - 1)) != 0) {
             if (pos.lower == 0 || pos.lower != p - size) return 0;
-            *pos.link = nextOf(pos.lower);
-            *classWordOf(pos.lower) = classWordFor(h, k + 1);
+            *pos.link = next_of(pos.lower);
+            *class_word_of(pos.lower) = class_word_for(h, k + 1);
             p = pos.lower;
         } else {
             if (pos.upper == 0 || pos.upper != p + size) return 0;
-            *pos.upperLink = pos.lower;
-            *classWordOf(p) = classWordFor(h, k + 1);
+            *pos.upper_link = pos.lower;
+            *class_word_of(p) = class_word_for(h, k + 1);
         }
     }
 }
@@ -122,7 +122,7 @@ using namespace qorbu::shm;
 extern "C" {
 
 QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
-    const int k = n < kAllocLimit ? classFor(n) : -1;
+    const int k = n < kAllocLimit ? class_for(n) : -1;
     if (k < 0) {
         errno = ENOMEM;
         return nullptr;
@@ -132,41 +132,41 @@ QORBU_API void *ShmAlloc(ShmHandle *h, uint32_t n) {
         errno = err;
         return nullptr;
     }
-    lock.markBusy();
+    lock.mark_busy();
     ShmHeader *header = h->base;
-    const int j = firstNonEmptyFrom(header, k);
-    const uintptr_t block = j < 0 ? 0 : takeAndSplit(header, j, shapeOf(h, j), k);
+    const int j = first_non_empty_from(header, k);
+    const uintptr_t block = j < 0 ? 0 : take_and_split(header, j, shape_of(h, j), k);
     lock.release();
     if (block == 0) {
         errno = j < 0 ? ENOMEM : kDamaged;
         return nullptr;
     }
-    *classWordOf(block) = classWordFor(header, k);
+    *class_word_of(block) = class_word_for(header, k);
     return reinterpret_cast<void *>(block);
 }
 
 QORBU_API void ShmFree(ShmHandle *h, void *p) {
     if (p == nullptr) return;
     const uintptr_t block = reinterpret_cast<uintptr_t>(p);
-    const int k = classNamedBelow(h->base, areaOf(h), block);
-    if (k < 0 || !shapeOf(h, k).fits(block)) {
-        reportMismatch();
+    const int k = class_named_below(h->base, area_of(h), block);
+    if (k < 0 || !shape_of(h, k).fits(block)) {
+        report_mismatch();
         return;
     }
-    const uintptr_t word = *classWordOf(block);
+    const uintptr_t word = *class_word_of(block);
     SegmentLock lock(h);
     if (int err = lock.error()) {
         errno = err;
         return;
     }
     // Another thread may have overwritten the class word meanwhile.
-    if (*classWordOf(block) != word) {
+    if (*class_word_of(block) != word) {
         lock.release();
-        reportMismatch();
+        report_mismatch();
         return;
     }
-    lock.markBusy();
-    if (int err = insertAndMerge(h, block, k, lock)) {
+    lock.mark_busy();
+    if (int err = insert_and_merge(h, block, k, lock)) {
         lock.release();
         errno = err;
     }
@@ -180,8 +180,8 @@ QORBU_API uint32_t ShmTotalFree(ShmHandle *h) {
     }
     uint32_t total = 0;
     for (int k = 0; k < kClassCount; k++) {
-        ListCursor cursor(h->base, k, shapeOf(h, k));
-        for (; cursor.entry() != 0; cursor.advance()) total += static_cast<uint32_t>(blockSize(k));
+        ListCursor cursor(h->base, k, shape_of(h, k));
+        for (; cursor.entry() != 0; cursor.advance()) total += static_cast<uint32_t>(block_size(k));
         if (cursor.damaged()) {
             lock.release();
             errno = kDamaged;
@@ -193,13 +193,13 @@ QORBU_API uint32_t ShmTotalFree(ShmHandle *h) {
 
 QORBU_API void ShmPrintFree(FILE *stream, ShmHeader *header) {
     // The lists are checked against the process's own mapping of the segment.
-    const uint32_t length = mappedLength(header);
-    const uintptr_t page = pageSize();
+    const uint32_t length = mapped_length(header);
+    const uintptr_t page = page_size();
     bool damaged = length == 0;
     for (int k = 0; k < kClassCount; k++) {
-        fprintf(stream, "0x%08x [%d] = { ", static_cast<unsigned>(blockSize(k)), k);
+        fprintf(stream, "0x%08x [%d] = { ", static_cast<unsigned>(block_size(k)), k);
         if (length != 0) {
-            ListCursor cursor(header, dataAreaOf(header, length, page), k);
+            ListCursor cursor(header, data_area_of(header, length, page), k);
             while (cursor.entry() != 0) {
                 const uintptr_t e = cursor.entry();
                 cursor.advance();
@@ -212,25 +212,25 @@ QORBU_API void ShmPrintFree(FILE *stream, ShmHeader *header) {
     if (damaged) errno = kDamaged;
 }
 
-__attribute__((visibility("hidden"))) int qorbuShmSummarise(const ShmHandle *h, ShmFreeSummary *summary) {
+__attribute__((visibility("hidden"))) int qorbu_shm_summarise(const ShmHandle *h, ShmFreeSummary *summary) {
     *summary = ShmFreeSummary{0, 0, 0};
     for (int k = 0; k < kClassCount; k++) {
-        ListCursor cursor(h->base, k, shapeOf(h, k));
+        ListCursor cursor(h->base, k, shape_of(h, k));
         for (; cursor.entry() != 0; cursor.advance()) {
-            summary->freeBytes += static_cast<uint32_t>(blockSize(k));
+            summary->free_bytes += static_cast<uint32_t>(block_size(k));
             summary->blocks++;
-            summary->largest = static_cast<uint32_t>(blockSize(k));
+            summary->largest = static_cast<uint32_t>(block_size(k));
         }
         if (cursor.damaged()) return kDamaged;
     }
     return 0;
 }
 
-__attribute__((visibility("hidden"))) ShmBlockState qorbuShmBlockState(const ShmHandle *h, const void *p) {
+__attribute__((visibility("hidden"))) ShmBlockState qorbu_shm_block_state(const ShmHandle *h, const void *p) {
     const uintptr_t block = reinterpret_cast<uintptr_t>(p);
-    const int k = classNamedBelow(h->base, areaOf(h), block);
-    if (k < 0 || !shapeOf(h, k).fits(block)) return SHM_BLOCK_FOREIGN;
-    const ListPosition pos = findPosition(h->base, k, shapeOf(h, k), block);
+    const int k = class_named_below(h->base, area_of(h), block);
+    if (k < 0 || !shape_of(h, k).fits(block)) return SHM_BLOCK_FOREIGN;
+    const ListPosition pos = find_position(h->base, k, shape_of(h, k), block);
     if (pos.damaged) return SHM_BLOCK_DAMAGED;
     return pos.lower == block ? SHM_BLOCK_FREE : SHM_BLOCK_ALLOCATED;
 }

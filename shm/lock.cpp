@@ -10,7 +10,7 @@ namespace qorbu::shm {
 
 namespace {
 
-/* Attributes destroyed on every path out of initSegmentMutex. */
+/* Attributes destroyed on every path out of init_segment_mutex. */
 class MutexAttributes {
   public:
     MutexAttributes() : error_(pthread_mutexattr_init(&attr_)) {}
@@ -29,7 +29,7 @@ class MutexAttributes {
 
 } // namespace
 
-int initSegmentMutex(pthread_mutex_t *mutex) {
+int init_segment_mutex(pthread_mutex_t *mutex) {
     MutexAttributes attr;
     if (attr.error() != 0) return attr.error();
     // A process-private futex never wakes a waiter in another process.
@@ -50,29 +50,29 @@ SegmentLock::SegmentLock(ShmHandle *h) : handle_(h) {
         error_ = EBADF;
         return;
     }
-    if (loadWord(h->base->useFlock) == 1 && !lockDescriptor()) return;
-    if (!lockMutex()) {
-        unlockDescriptor();
+    if (load_word(h->base->useFlock) == 1 && !lock_descriptor()) return;
+    if (!lock_mutex()) {
+        unlock_descriptor();
         return;
     }
-    if (loadWord(h->base->busy) == 1) {
+    if (load_word(h->base->busy) == 1) {
         release();
         error_ = EBUSY;
     }
 }
 
-bool SegmentLock::lockDescriptor() {
+bool SegmentLock::lock_descriptor() {
     while (flock(handle_->fd, LOCK_EX) != 0) {
         if (errno != EINTR) {
             error_ = errno;
             return false;
         }
     }
-    flockTaken_ = true;
+    flock_taken_ = true;
     return true;
 }
 
-bool SegmentLock::lockMutex() {
+bool SegmentLock::lock_mutex() {
     int err = pthread_mutex_lock(&handle_->base->mutex);
     if (err == EOWNERDEAD) {
         // The holder died. Inside an allocation or free it left busy at 1,
@@ -84,31 +84,31 @@ bool SegmentLock::lockMutex() {
         error_ = err;
         return false;
     }
-    mutexTaken_ = true;
+    mutex_taken_ = true;
     return true;
 }
 
-void SegmentLock::unlockDescriptor() {
-    if (!flockTaken_) return;
+void SegmentLock::unlock_descriptor() {
+    if (!flock_taken_) return;
     flock(handle_->fd, LOCK_UN);
-    flockTaken_ = false;
+    flock_taken_ = false;
 }
 
-void SegmentLock::markBusy() {
-    storeWord(handle_->base->busy, 1);
-    busySet_ = true;
+void SegmentLock::mark_busy() {
+    store_word(handle_->base->busy, 1);
+    busy_set_ = true;
 }
 
 void SegmentLock::release() {
-    if (busySet_) {
-        storeWord(handle_->base->busy, 0);
-        busySet_ = false;
+    if (busy_set_) {
+        store_word(handle_->base->busy, 0);
+        busy_set_ = false;
     }
-    if (mutexTaken_) {
+    if (mutex_taken_) {
         pthread_mutex_unlock(&handle_->base->mutex);
-        mutexTaken_ = false;
+        mutex_taken_ = false;
     }
-    unlockDescriptor();
+    unlock_descriptor();
 }
 
 } // namespace qorbu::shm

@@ -15,25 +15,25 @@ namespace qorbu::shm {
 
 namespace {
 
-pthread_mutex_t tableLock = PTHREAD_MUTEX_INITIALIZER;
+pthread_mutex_t table_lock = PTHREAD_MUTEX_INITIALIZER;
 ShmMapping *table = nullptr;
 
 class TableGuard {
   public:
-    TableGuard() { pthread_mutex_lock(&tableLock); }
-    ~TableGuard() { pthread_mutex_unlock(&tableLock); }
+    TableGuard() { pthread_mutex_lock(&table_lock); }
+    ~TableGuard() { pthread_mutex_unlock(&table_lock); }
     TableGuard(const TableGuard &) = delete;
     TableGuard &operator=(const TableGuard &) = delete;
 };
 
-ShmMapping *findMapping(dev_t dev, ino_t ino) {
+ShmMapping *find_mapping(dev_t dev, ino_t ino) {
     for (ShmMapping *m = table; m != nullptr; m = m->next) {
         if (m->dev == dev && m->ino == ino) return m;
     }
     return nullptr;
 }
 
-void unlinkMapping(ShmMapping *gone) {
+void unlink_mapping(ShmMapping *gone) {
     for (ShmMapping **link = &table; *link != nullptr; link = &(*link)->next) {
         if (*link == gone) {
             *link = gone->next;
@@ -42,21 +42,21 @@ void unlinkMapping(ShmMapping *gone) {
     }
 }
 
-int protectionFor(bool writable) { return writable ? PROT_READ | PROT_WRITE : PROT_READ; }
+int protection_for(bool writable) { return writable ? PROT_READ | PROT_WRITE : PROT_READ; }
 
 /* Where the system may place a segment: a header address at which the data
  * area starts on a multiple of its length rounded up to a power of two (at
  * most the largest block), so that every block can merge with its partner.
  * A reservation of the room needed is made and kept in *reserved (0 when
  * even that fails: the system then picks any address). */
-uintptr_t alignedPlace(uint32_t length, uintptr_t *reserved, size_t *reservedLength) {
-    const uintptr_t page = pageSize();
+uintptr_t aligned_place(uint32_t length, uintptr_t *reserved, size_t *reserved_length) {
+    const uintptr_t page = page_size();
     uintptr_t align = page;
-    while (align < length - page && align < blockSize(kLargestClass)) align <<= 1;
-    *reservedLength = length + align;
+    while (align < length - page && align < block_size(kLargestClass)) align <<= 1;
+    *reserved_length = length + align;
     *reserved = 0;
-    if (*reservedLength < length) return 0; // no room in a 32-bit address space
-    void *p = mmap(nullptr, *reservedLength, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
+    if (*reserved_length < length) return 0; // no room in a 32-bit address space
+    void *p = mmap(nullptr, *reserved_length, PROT_NONE, MAP_PRIVATE | MAP_ANONYMOUS | MAP_NORESERVE, -1, 0);
     if (p == MAP_FAILED) return 0;
     *reserved = reinterpret_cast<uintptr_t>(p);
     return ((*reserved + page + align - 1) & ~(align - 1)) - page;
@@ -65,25 +65,25 @@ uintptr_t alignedPlace(uint32_t length, uintptr_t *reserved, size_t *reservedLen
 /* Maps at exactly addr without replacing anything there (some kernels and
  * emulators take the flag as a mere hint), or at a place of the library's
  * choosing for addr 0. */
-int mapSegment(int fd, uintptr_t addr, uint32_t length, bool writable, uintptr_t *mapped) {
+int map_segment(int fd, uintptr_t addr, uint32_t length, bool writable, uintptr_t *mapped) {
     uintptr_t reserved = 0;
-    size_t reservedLength = 0;
+    size_t reserved_length = 0;
     int flags = MAP_SHARED;
     if (addr != 0) {
         flags |= MAP_FIXED_NOREPLACE;
-    } else if ((addr = alignedPlace(length, &reserved, &reservedLength)) != 0) {
+    } else if ((addr = aligned_place(length, &reserved, &reserved_length)) != 0) {
         flags |= MAP_FIXED; // over this call's own reservation
     }
-    void *p = mmap(reinterpret_cast<void *>(addr), length, protectionFor(writable), flags, fd, 0);
+    void *p = mmap(reinterpret_cast<void *>(addr), length, protection_for(writable), flags, fd, 0);
     const int err = errno;
     if (reserved != 0) {
         // Give back the parts of the reservation that the segment does not cover.
-        const uintptr_t end = addr + length, reservedEnd = reserved + reservedLength;
+        const uintptr_t end = addr + length, reserved_end = reserved + reserved_length;
         if (p == MAP_FAILED) {
-            munmap(reinterpret_cast<void *>(reserved), reservedLength);
+            munmap(reinterpret_cast<void *>(reserved), reserved_length);
         } else {
             if (addr > reserved) munmap(reinterpret_cast<void *>(reserved), addr - reserved);
-            if (reservedEnd > end) munmap(reinterpret_cast<void *>(end), reservedEnd - end);
+            if (reserved_end > end) munmap(reinterpret_cast<void *>(end), reserved_end - end);
         }
     }
     if (p == MAP_FAILED) return err;
@@ -99,9 +99,9 @@ int mapSegment(int fd, uintptr_t addr, uint32_t length, bool writable, uintptr_t
  * the same object mapped again over its own range, contents unchanged. A
  * failed fixed mapping may have dropped the old one: a read-only view is
  * put back, so that the other handles keep a mapping. */
-int upgradeToWritable(ShmMapping *m, int fd) {
+int upgrade_to_writable(ShmMapping *m, int fd) {
     void *where = reinterpret_cast<void *>(m->base);
-    if (upgradeMap(where, m->length, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_FIXED, fd, 0) != MAP_FAILED) {
+    if (upgrade_map(where, m->length, PROT_READ | PROT_WRITE, MAP_SHARED | MAP_FIXED, fd, 0) != MAP_FAILED) {
         m->writable = true;
         return 0;
     }
@@ -110,7 +110,7 @@ int upgradeToWritable(ShmMapping *m, int fd) {
     return err;
 }
 
-void fillHandle(ShmHandle *h, ShmMapping *m) {
+void fill_handle(ShmHandle *h, ShmMapping *m) {
     h->base = reinterpret_cast<ShmHeader *>(m->base);
     h->size = m->length;
     h->mapping = m;
@@ -120,33 +120,33 @@ void fillHandle(ShmHandle *h, ShmMapping *m) {
 
 } // namespace
 
-void *(*upgradeMap)(void *, size_t, int, int, int, off_t) = mmap;
+void *(*upgrade_map)(void *, size_t, int, int, int, off_t) = mmap;
 
-int attachMapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t length) {
+int attach_mapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t length) {
     TableGuard guard;
-    if (ShmMapping *m = findMapping(dev, ino)) {
+    if (ShmMapping *m = find_mapping(dev, ino)) {
         if (h->writable && !m->writable) {
-            if (int err = upgradeToWritable(m, h->fd)) return err;
+            if (int err = upgrade_to_writable(m, h->fd)) return err;
         }
-        fillHandle(h, m);
+        fill_handle(h, m);
         return 0;
     }
     auto *m = static_cast<ShmMapping *>(malloc(sizeof(ShmMapping)));
     if (m == nullptr) return ENOMEM;
     uintptr_t mapped = 0;
-    if (int err = mapSegment(h->fd, addr, length, h->writable, &mapped)) {
+    if (int err = map_segment(h->fd, addr, length, h->writable, &mapped)) {
         free(m);
         return err;
     }
     *m = ShmMapping{dev, ino, mapped, length, h->writable != 0, 0, 0, table, {}, {}};
-    m->area = dataAreaOf(reinterpret_cast<void *>(mapped), length, pageSize());
+    m->area = data_area_of(reinterpret_cast<void *>(mapped), length, page_size());
     for (int k = 0; k < kClassCount; k++) m->shapes[k] = ClassShape(m->area, k);
     table = m;
-    fillHandle(h, m);
+    fill_handle(h, m);
     return 0;
 }
 
-void detachMapping(ShmHandle *h) {
+void detach_mapping(ShmHandle *h) {
     ShmMapping *m = h->mapping;
     if (m == nullptr) return;
     TableGuard guard;
@@ -160,12 +160,12 @@ void detachMapping(ShmHandle *h) {
         }
         return;
     }
-    unlinkMapping(m);
+    unlink_mapping(m);
     munmap(reinterpret_cast<void *>(m->base), m->length);
     free(m);
 }
 
-uint32_t mappedLength(const void *base) {
+uint32_t mapped_length(const void *base) {
     TableGuard guard;
     for (ShmMapping *m = table; m != nullptr; m = m->next) {
         if (m->base == reinterpret_cast<uintptr_t>(base)) return m->length;

@@ -11,14 +11,14 @@ extern "C" {
 #endif
 
 typedef struct ShmFreeSummary {
-    uint32_t freeBytes; /* whole free blocks */
-    uint32_t blocks;    /* number of free blocks */
-    uint32_t largest;   /* size of the largest free block, 0 when none */
+    uint32_t free_bytes; /* whole free blocks */
+    uint32_t blocks;     /* number of free blocks */
+    uint32_t largest;    /* size of the largest free block, 0 when none */
 } ShmFreeSummary;
 
 /* Walks every free list of the handle's segment, without the segment lock.
  * Returns 0, or EUCLEAN when a list is damaged. */
-__attribute__((visibility("hidden"))) int qorbuShmSummarise(const ShmHandle *h, ShmFreeSummary *summary);
+__attribute__((visibility("hidden"))) int qorbu_shm_summarise(const ShmHandle *h, ShmFreeSummary *summary);
 
 typedef enum ShmBlockState {
     SHM_BLOCK_ALLOCATED, /* a block as ShmAlloc hands them out, not in its free list */
@@ -28,7 +28,7 @@ typedef enum ShmBlockState {
 } ShmBlockState;
 
 /* What ShmFree would find at p, without the segment lock. */
-__attribute__((visibility("hidden"))) ShmBlockState qorbuShmBlockState(const ShmHandle *h, const void *p);
+__attribute__((visibility("hidden"))) ShmBlockState qorbu_shm_block_state(const ShmHandle *h, const void *p);
 
 #ifdef __cplusplus
 }

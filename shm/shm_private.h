@@ -28,7 +28,7 @@ constexpr int kWordShift = sizeof(uintptr_t) == 8 ? 3 : 2;  // log2 of sizeof(ui
 constexpr int kDamaged = EUCLEAN;              // errno of an operation that met damaged lists
 
 constexpr int kSmallestShift = 3;  // log2 of kSmallestBlock
-constexpr uintptr_t blockSize(int k) { return kSmallestBlock << k; }
+constexpr uintptr_t block_size(int k) { return kSmallestBlock << k; }
 static_assert(kSmallestBlock == uintptr_t{1} << kSmallestShift);
 static_assert(sizeof(uintptr_t) == uintptr_t{1} << kWordShift);
 
@@ -50,25 +50,25 @@ static_assert(sizeof(ShmHeader) == offsetof(ShmHeader, freeList) + kClassCount *
 
 /* The page size, as every segment computation uses it: asked of the system
  * once per process (the allocator's hot path needs it on every call). */
-extern std::atomic<uintptr_t> cachedPageSize;
-uintptr_t readPageSize();
-inline uintptr_t pageSize() {
-    const uintptr_t page = cachedPageSize.load(std::memory_order_relaxed);
-    return page != 0 ? page : readPageSize();
+extern std::atomic<uintptr_t> cached_page_size;
+uintptr_t read_page_size();
+inline uintptr_t page_size() {
+    const uintptr_t page = cached_page_size.load(std::memory_order_relaxed);
+    return page != 0 ? page : read_page_size();
 }
 
 /* Publication: the creator's store of `size` comes after everything else,
  * an attacher's reads of the header after its read of `size`. */
-inline uint32_t loadPublishedSize(const ShmHeader *h) {
+inline uint32_t load_published_size(const ShmHeader *h) {
     return std::atomic_ref<uint32_t>(const_cast<uint32_t &>(h->size)).load(std::memory_order_acquire);
 }
-inline void publishSize(ShmHeader *h, uint32_t size) {
+inline void publish_size(ShmHeader *h, uint32_t size) {
     std::atomic_ref<uint32_t>(h->size).store(size, std::memory_order_release);
 }
-inline uint32_t loadWord(const uint32_t &word) {
+inline uint32_t load_word(const uint32_t &word) {
     return std::atomic_ref<uint32_t>(const_cast<uint32_t &>(word)).load(std::memory_order_acquire);
 }
-inline void storeWord(uint32_t &word, uint32_t value) {
+inline void store_word(uint32_t &word, uint32_t value) {
     std::atomic_ref<uint32_t>(word).store(value, std::memory_order_release);
 }
 
@@ -79,24 +79,24 @@ inline void storeWord(uint32_t &word, uint32_t value) {
  * fills the handle's base, size and mapping. addr 0 lets the system choose.
  * A range the process already uses is never replaced: EEXIST. Returns 0, or
  * an errno value with nothing acquired. */
-int attachMapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t length);
+int attach_mapping(ShmHandle *h, dev_t dev, ino_t ino, uintptr_t addr, uint32_t length);
 
 /* Drops the handle's reference; the last one unmaps the segment, and the
  * last read-write one turns the mapping back to read-only. */
-void detachMapping(ShmHandle *h);
+void detach_mapping(ShmHandle *h);
 
 /* The length of this process's mapping whose header lies at `base`, or 0. */
-uint32_t mappedLength(const void *base);
+uint32_t mapped_length(const void *base);
 
 /* The mmap that turns a read-only mapping read-write in place (tests put a
  * failing one here). */
-extern void *(*upgradeMap)(void *, size_t, int, int, int, off_t);
+extern void *(*upgrade_map)(void *, size_t, int, int, int, off_t);
 
 /* --- the segment lock (lock.cpp) ------------------------------------------ */
 
 /* Initialises the in-segment mutex process-shared and robust (robust where
  * the system offers it). Returns 0 or an errno value. */
-int initSegmentMutex(pthread_mutex_t *mutex);
+int init_segment_mutex(pthread_mutex_t *mutex);
 
 /* The descriptor lock (when useFlock was 1 on entry), then the mutex, then
  * the busy test; released in reverse order when it goes out of scope. */
@@ -110,45 +110,45 @@ class SegmentLock {
     /* 0 when the lock is held, otherwise the errno value of the failure. */
     int error() const { return error_; }
     /* Sets busy for an operation that changes the lists; cleared on release. */
-    void markBusy();
+    void mark_busy();
     /* Clears busy (where set) and releases both locks now. */
     void release();
 
   private:
-    bool lockDescriptor();
-    bool lockMutex();
-    void unlockDescriptor();
+    bool lock_descriptor();
+    bool lock_mutex();
+    void unlock_descriptor();
 
     ShmHandle *handle_;
     int error_ = 0;
-    bool flockTaken_ = false;
-    bool mutexTaken_ = false;
-    bool busySet_ = false;
+    bool flock_taken_ = false;
+    bool mutex_taken_ = false;
+    bool busy_set_ = false;
 };
 
 /* --- segments (segment.cpp) ------------------------------------------------ */
 
 /* Whole segment length for a request of `size` data bytes; 0 when the 32-bit
  * computation would wrap. */
-uint32_t segmentLength(uint32_t size);
+uint32_t segment_length(uint32_t size);
 
 /* EINVAL unless the published header describes a segment that can be trusted
- * in an object of `objectLength` bytes. */
-int validateHeader(uintptr_t base, uint32_t size, uint64_t objectLength);
+ * in an object of `object_length` bytes. */
+int validate_header(uintptr_t base, uint32_t size, uint64_t object_length);
 
 /* Greedy first division of the data area into free blocks, largest first. */
-void divideDataArea(ShmHeader *h, uint32_t length);
+void divide_data_area(ShmHeader *h, uint32_t length);
 
 /* --- buddy lists (buddy.cpp) ----------------------------------------------- */
 
 /* Smallest class whose blocks hold n bytes plus the class word, or -1. */
-int classFor(uint32_t n);
+int class_for(uint32_t n);
 
 /* The class word below a block and what it names. */
-inline uintptr_t *classWordOf(uintptr_t block) {
+inline uintptr_t *class_word_of(uintptr_t block) {
     return reinterpret_cast<uintptr_t *>(block - kClassWordSize);
 }
-inline uintptr_t classWordFor(const ShmHeader *h, int k) {
+inline uintptr_t class_word_for(const ShmHeader *h, int k) {
     return reinterpret_cast<uintptr_t>(&h->freeList[k]);
 }
 
@@ -157,10 +157,10 @@ inline uintptr_t classWordFor(const ShmHeader *h, int k) {
 struct DataArea {
     uintptr_t start;
     uintptr_t length;
-    int pageShift;  // log2 of the page size
+    int page_shift;  // log2 of the page size
 };
-inline DataArea dataAreaOf(const void *header, uint32_t mappingLength, uintptr_t page) {
-    return {reinterpret_cast<uintptr_t>(header) + page, mappingLength - page, std::countr_zero(page)};
+inline DataArea data_area_of(const void *header, uint32_t mapping_length, uintptr_t page) {
+    return {reinterpret_cast<uintptr_t>(header) + page, mapping_length - page, std::countr_zero(page)};
 }
 
 /* Where a sound block of class k may lie in a data area. Blocks are aligned
@@ -176,11 +176,11 @@ class ClassShape {
   public:
     ClassShape() = default;
     ClassShape(const DataArea &area, int k)
-        : start_(area.start), shift_(std::min(k + kSmallestShift, area.pageShift)),
-          step_((blockSize(k) >> shift_) - 1), top_(below(area.length >> shift_)) {}
+        : start_(area.start), shift_(std::min(k + kSmallestShift, area.page_shift)),
+          step_((block_size(k) >> shift_) - 1), top_(below(area.length >> shift_)) {}
     uintptr_t slot(uintptr_t address) const { return std::rotr(address - start_, shift_); }
     uintptr_t below(uintptr_t end) const { return end > step_ ? end - step_ : 0; }
-    bool spansPages() const { return step_ != 0; }
+    bool spans_pages() const { return step_ != 0; }
     /* The bound for a block anywhere in the data area. */
     uintptr_t top() const { return top_; }
     /* Whether a block of the class may lie at `address`. */
@@ -222,7 +222,7 @@ class ListCursor {
         if (slot < bound_) [[likely]] {
             entry_ = next;
             bound_ = slot;
-            if (shape_.spansPages()) [[unlikely]] bound_ = shape_.below(slot);
+            if (shape_.spans_pages()) [[unlikely]] bound_ = shape_.below(slot);
         } else {
             entry_ = 0;
             damaged_ = next != 0;
@@ -239,10 +239,10 @@ class ListCursor {
 /* The class that the class word below p names, where p is an aligned
  * address in the data area (the word is read only then), or -1. Whether a
  * block of that class may lie at p is ClassShape::fits. */
-inline int classNamedBelow(const ShmHeader *h, const DataArea &area, uintptr_t p) {
+inline int class_named_below(const ShmHeader *h, const DataArea &area, uintptr_t p) {
     if (std::rotr(p - area.start, kSmallestShift) >= area.length >> kSmallestShift) return -1;
     // The slot's index, or a huge number when the word is not a slot's address.
-    const uintptr_t index = std::rotr(*classWordOf(p) - classWordFor(h, 0), kWordShift);
+    const uintptr_t index = std::rotr(*class_word_of(p) - class_word_for(h, 0), kWordShift);
     return index < kClassCount ? static_cast<int>(index) : -1;
 }
 
@@ -266,8 +266,8 @@ struct ShmMapping {
 
 namespace qorbu::shm {
 
-inline const DataArea &areaOf(const ShmHandle *h) { return h->mapping->area; }
-inline const ClassShape &shapeOf(const ShmHandle *h, int k) { return h->mapping->shapes[k]; }
+inline const DataArea &area_of(const ShmHandle *h) { return h->mapping->area; }
+inline const ClassShape &shape_of(const ShmHandle *h, int k) { return h->mapping->shapes[k]; }
 
 } // namespace qorbu::shm
 

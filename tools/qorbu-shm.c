@@ -90,7 +90,7 @@ static int check_name(const char *name)
 }
 
 /* Decimal or 0x-hex, with an optional k or m suffix when allowed. */
-static int parse_number(const char *text, int allowSuffix, unsigned long long max, unsigned long long *value)
+static int parse_number(const char *text, int allow_suffix, unsigned long long max, unsigned long long *value)
 {
     char *end;
     errno = 0;
@@ -98,9 +98,9 @@ static int parse_number(const char *text, int allowSuffix, unsigned long long ma
     if (errno != 0 || end == text || text[0] == '-')
         return -1;
     unsigned long long scale = 1;
-    if (allowSuffix && (*end == 'k' || *end == 'K'))
+    if (allow_suffix && (*end == 'k' || *end == 'K'))
         scale = 1024, ++end;
-    else if (allowSuffix && (*end == 'm' || *end == 'M'))
+    else if (allow_suffix && (*end == 'm' || *end == 'M'))
         scale = 1024 * 1024, ++end;
     if (*end != '\0' || parsed > max / scale)
         return -1;
@@ -195,16 +195,16 @@ static void print_header_fields(const char *name, const Peek *peek)
 /* Read-only handles cannot take the segment's lock, so a busy segment is
  * refused at once instead of being waited for; read-write attaches leave
  * that decision to the library. */
-static int attach(const char *name, int mode, ShmHandle **handle, Peek *peekOut)
+static int attach(const char *name, int mode, ShmHandle **handle, Peek *peek_out)
 {
     Peek peek;
     int status = peek_header(name, &peek);
     if (status != EXIT_OK)
         return status;
-    if (peekOut)
-        *peekOut = peek;
+    if (peek_out)
+        *peek_out = peek;
     if (mode == O_RDONLY && peek.busy)
-        return peekOut ? kBusyUnreported : busy_error(name);
+        return peek_out ? kBusyUnreported : busy_error(name);
     *handle = ShmOpen(name, mode);
     if (*handle)
         return EXIT_OK;
@@ -290,10 +290,10 @@ static int cmd_info(int argc, char **argv)
     peek = (Peek){header->base, header->size, header->useFlock, header->busy};
     print_header_fields(argv[0], &peek);
     ShmFreeSummary stats;
-    if (qorbuShmSummarise(handle, &stats) != 0) {
+    if (qorbu_shm_summarise(handle, &stats) != 0) {
         status = damaged_error(argv[0]);
     } else {
-        printf("free      %" PRIu32 "\n", stats.freeBytes);
+        printf("free      %" PRIu32 "\n", stats.free_bytes);
         printf("blocks    %" PRIu32 " free\n", stats.blocks);
         printf("largest   %" PRIu32 "\n", stats.largest);
     }
@@ -315,7 +315,7 @@ static int cmd_dump(int argc, char **argv)
     ShmFreeSummary stats;
     if (header->busy)
         status = busy_error(argv[0]);
-    else if (qorbuShmSummarise(handle, &stats) != 0)
+    else if (qorbu_shm_summarise(handle, &stats) != 0)
         status = damaged_error(argv[0]);
     else
         ShmPrintFree(stdout, header);
@@ -340,7 +340,7 @@ static int cmd_alloc(int argc, char **argv)
     /* A damaged segment is refused as a whole, as info reports it. */
     ShmFreeSummary stats;
     void *block = NULL;
-    if (qorbuShmSummarise(handle, &stats) == 0)
+    if (qorbu_shm_summarise(handle, &stats) == 0)
         block = ShmAlloc(handle, (uint32_t)size);
     else
         errno = EUCLEAN;
@@ -362,7 +362,7 @@ static int cmd_alloc(int argc, char **argv)
  * on a double free; the tool checks first so that both get an exit code. */
 static int check_block(const ShmHandle *handle, uintptr_t address, const char *text)
 {
-    switch (qorbuShmBlockState(handle, (const void *)address)) {
+    switch (qorbu_shm_block_state(handle, (const void *)address)) {
     case SHM_BLOCK_ALLOCATED:
         return EXIT_OK;
     case SHM_BLOCK_FREE:
@@ -372,9 +372,9 @@ static int check_block(const ShmHandle *handle, uintptr_t address, const char *t
     default:
         break;
     }
-    const uintptr_t dataStart = (uintptr_t)ShmAddr((ShmHandle *)handle);
+    const uintptr_t data_start = (uintptr_t)ShmAddr((ShmHandle *)handle);
     return fail(EXIT_USAGE, "address %s is not a block of this segment's data area (%#" PRIxPTR
-                "..%#" PRIxPTR ")", text, dataStart, dataStart + handle->size - (uintptr_t)ShmOverhead());
+                "..%#" PRIxPTR ")", text, data_start, data_start + handle->size - (uintptr_t)ShmOverhead());
 }
 
 static int cmd_free(int argc, char **argv)
@@ -395,7 +395,7 @@ static int cmd_free(int argc, char **argv)
     ShmFreeSummary stats;
     if (header->busy)
         status = busy_error(argv[0]);
-    else if (qorbuShmSummarise(handle, &stats) != 0)
+    else if (qorbu_shm_summarise(handle, &stats) != 0)
         status = damaged_error(argv[0]);
     else
         status = check_block(handle, (uintptr_t)address, argv[1]);

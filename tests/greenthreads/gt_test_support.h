@@ -7,12 +7,12 @@
 #include <arpa/inet.h>
 #include <fcntl.h>
 #include <netinet/in.h>
-#include <stdio.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
-#include <time.h>
 #include <unistd.h>
 
+#include <cstdio>
+#include <ctime>
 #include <string>
 #include <utility>
 

@@ -1,7 +1,7 @@
 // Guarded green-thread stacks: size, guard page, protection, and what
 // happens when a stack overflows or cannot be mapped.
-#include <signal.h>
-#include <stdlib.h>
+#include <csignal>
+#include <cstdlib>
 
 #include "gt_test_support.h"
 

@@ -82,7 +82,7 @@ pid_t startLockHolder(const char *name, bool busy) {
             ShmHandle *h = ShmOpen(name, O_RDWR);
             qorbu::shm::SegmentLock lock(h);
             if (lock.error() != 0) return 1;
-            if (busy) lock.markBusy();
+            if (busy) lock.mark_busy();
             if (write(ready[1], "x", 1) == 1) pause();
             return 1;
         },

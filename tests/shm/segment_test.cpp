@@ -26,9 +26,9 @@ void writeRawHeader(const NameGuard &name, uint32_t pages, uintptr_t base, uint3
     void *p = mmap(nullptr, pages * pageBytes(), PROT_READ | PROT_WRITE, MAP_SHARED, fd, 0);
     ASSERT_NE(p, MAP_FAILED);
     auto *h = static_cast<ShmHeader *>(p);
-    ASSERT_EQ(qorbu::shm::initSegmentMutex(&h->mutex), 0);
+    ASSERT_EQ(qorbu::shm::init_segment_mutex(&h->mutex), 0);
     h->base = base;
-    qorbu::shm::publishSize(h, size);
+    qorbu::shm::publish_size(h, size);
     munmap(p, pages * pageBytes());
     close(fd);
 }
@@ -134,13 +134,13 @@ TEST(ShmSegment, HandlesShareOneMappingAndReadOnlyOnesRefuseLockedOperations) {
 
     // An upgrade whose mapping fails (and drops the old one) leaves the reader its mapping.
     const int fds = openDescriptorCount();
-    qorbu::shm::upgradeMap = [](void *addr, size_t length, int, int, int, off_t) -> void * {
+    qorbu::shm::upgrade_map = [](void *addr, size_t length, int, int, int, off_t) -> void * {
         munmap(addr, length);
         errno = ENOMEM;
         return MAP_FAILED;
     };
     EXPECT_REFUSED(ENOMEM, ShmOpen(name.c_str(), O_RDWR));
-    qorbu::shm::upgradeMap = mmap;
+    qorbu::shm::upgrade_map = mmap;
     EXPECT_EQ(openDescriptorCount(), fds);
     ASSERT_EQ(reinterpret_cast<uintptr_t>(reader->base), base);
     EXPECT_EQ(reader->base->base, base) << "the reader's mapping is gone";
@@ -223,9 +223,9 @@ TEST(ShmPublication, AttacherWaitsForLengthThenPublication) {
     ASSERT_NE(hdr, MAP_FAILED);
     usleep(500 * 1000);
     hdr->base = reinterpret_cast<uintptr_t>(hdr);
-    qorbu::shm::divideDataArea(hdr, size);
-    ASSERT_EQ(qorbu::shm::initSegmentMutex(&hdr->mutex), 0);
-    qorbu::shm::publishSize(hdr, size);
+    qorbu::shm::divide_data_area(hdr, size);
+    ASSERT_EQ(qorbu::shm::init_segment_mutex(&hdr->mutex), 0);
+    qorbu::shm::publish_size(hdr, size);
     EXPECT_EQ(waitStatus(child), 0);
     EXPECT_EQ(hdr->useFlock, 1u);
     munmap(hdr, size);

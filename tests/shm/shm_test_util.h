@@ -7,12 +7,12 @@
 #include "support/test_support.h"
 
 #include <cerrno>
+#include <csignal>
 #include <cstdint>
 #include <cstdio>
 #include <cstring>
 #include <dirent.h>
 #include <functional>
-#include <signal.h>
 #include <string>
 #include <sys/mman.h>
 #include <sys/wait.h>

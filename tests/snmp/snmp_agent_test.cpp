@@ -12,10 +12,10 @@
 #include <spawn.h>
 #include <sys/socket.h>
 #include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <cstdlib>
+#include <ctime>
 #include <string>
 
 #include "selector/sel.h"
