@@ -5,12 +5,10 @@
 
 #include "greenthreads/greenthread_private.h"
 #include "nbio/nb_private.h"
+#include "selector/time_private.h"
 
 namespace qorbu::nb {
 namespace {
-
-constexpr long kNsecPerMsec = 1000000;
-constexpr int kMsecPerSec = 1000;
 
 /* Blocks the green thread until a callback has set the result; a wakeup
  * from elsewhere that leaves it at 0 blocks again. The main context may not
@@ -42,7 +40,8 @@ int arm_timeout(SelTimer &timer, NbWait &wait, int timeout)
     timer.heapIndex = 0;
     timer.callback = nb_poll_on_timeout;
     timer.arg = &wait;
-    SelMakeWhen(&timer.when, timeout / kMsecPerSec, (timeout % kMsecPerSec) * kNsecPerMsec);
+    const struct timespec span = sel::ms_to_timespec(timeout);
+    SelMakeWhen(&timer.when, static_cast<long>(span.tv_sec), span.tv_nsec);
     return SelAddTimer(&timer) == 0 ? 0 : -1;
 }
 

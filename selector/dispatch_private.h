@@ -34,10 +34,6 @@ inline constexpr int kEinvalFailuresTolerated = 4; /* the fifth one aborts */
 inline constexpr int kEpollBatch = 100;            /* events taken by the non-blocking wait */
 inline constexpr int kEpollBlockingBatch = 1;      /* events taken by the blocking wait */
 inline constexpr int kPrintedWordBits = 32;        /* the EINVAL diagnostic prints 32-bit words */
-inline constexpr long kNsecPerSec = 1000000000L;
-inline constexpr long kNsecPerUsec = 1000L;
-inline constexpr long kNsecPerMsec = 1000000L;
-inline constexpr long kMsecPerSec = 1000L;
 
 /* Waits that failed with EINVAL since the last read/write scan that ended
  * with ready pairs left over; shared by every selector thread. */

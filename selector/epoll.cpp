@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include "selector/dispatch_private.h"
+#include "selector/time_private.h"
 
 namespace qorbu::sel {
 namespace {
@@ -63,14 +64,7 @@ bool timer_armed(const SelContext *ctx) { return ctx->timerCount > 0 && ctx->tim
 
 int epoll_timeout_ms(const SelContext *ctx, const struct timespec &now) {
     if (ctx->timerCount <= 0 || !ctx->timerHeap[1]) return 0;
-    const struct timespec &when = ctx->timerHeap[1]->when;
-    long long sec = static_cast<long long>(when.tv_sec) - now.tv_sec;
-    long long nsec = static_cast<long long>(when.tv_nsec) - now.tv_nsec;
-    if (nsec < 0) {
-        sec -= 1;
-        nsec += kNsecPerSec;
-    }
-    const long long ms = sec * kMsecPerSec + nsec / kNsecPerMsec;
+    const long long ms = timespec_to_ms(timespec_sub(ctx->timerHeap[1]->when, now));
     if (ms < 0) return 0;
     return ms > INT_MAX ? INT_MAX : static_cast<int>(ms);
 }

@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "selector/dispatch_private.h"
+#include "selector/time_private.h"
 
 namespace {
 
@@ -75,7 +76,7 @@ void remove_ours(int nfds, const fd_set *ours) {
  * negative one); so does the wait here, in 64-bit arithmetic that saturates
  * where the sum would overflow. */
 void split_timeout(const struct timeval &tv, long *sec, long *nsec) {
-    constexpr long long kUsecPerSec = 1000000;
+    using qorbu::sel::kUsecPerSec;
     long long usec = tv.tv_usec;
     long long carry = usec / kUsecPerSec;
     usec %= kUsecPerSec;

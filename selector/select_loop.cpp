@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "selector/dispatch_private.h"
+#include "selector/time_private.h"
 
 namespace qorbu::sel {
 
@@ -96,22 +97,6 @@ void merge_snmp_reads(Pass &p) {
 
 /* --- the time-out ---------------------------------------------------------- */
 
-struct timespec difference(const struct timespec &later, const struct timespec &earlier) {
-    struct timespec d = {later.tv_sec - earlier.tv_sec, later.tv_nsec - earlier.tv_nsec};
-    if (d.tv_nsec < 0) {
-        d.tv_sec -= 1;
-        d.tv_nsec += kNsecPerSec;
-    }
-    return d;
-}
-
-struct timespec to_timespec(const struct timeval &tv) {
-    struct timespec ts;
-    ts.tv_sec = tv.tv_sec;
-    ts.tv_nsec = static_cast<long>(static_cast<long long>(tv.tv_usec) * kNsecPerUsec);
-    return ts;
-}
-
 /* Candidates are offered in the order timer, host, SNMP: an equal later
  * candidate does not replace an earlier one. */
 void offer_timeout(Pass &p, TimeoutSource source, const struct timespec &candidate) {
@@ -125,7 +110,7 @@ void choose_timer_timeout(Pass &p) {
     const SelContext *ctx = p.ctx;
     if (ctx->timerCount <= 0 || !ctx->timerHeap[1]) return;
     p.chosen = TimeoutSource::Timer;
-    p.timeout = difference(ctx->timerHeap[1]->when, p.now);
+    p.timeout = timespec_sub(ctx->timerHeap[1]->when, p.now);
 }
 
 bool earliest_host_due_time(const SelHostScheduler *host, struct timeval *earliest) {
@@ -149,12 +134,12 @@ void choose_host_timeout(Pass &p) {
         p.timeout = {0, 0};
         return;
     }
-    offer_timeout(p, TimeoutSource::Host, to_timespec(timeval_sub(due, hostNow)));
+    offer_timeout(p, TimeoutSource::Host, timeval_to_timespec(timeval_sub(due, hostNow)));
 }
 
 void choose_snmp_timeout(Pass &p) {
     query_snmp(p);
-    if (p.snmp.block == 0) offer_timeout(p, TimeoutSource::Snmp, to_timespec(p.snmp.timeout));
+    if (p.snmp.block == 0) offer_timeout(p, TimeoutSource::Snmp, timeval_to_timespec(p.snmp.timeout));
 }
 
 void clear_negative_timeout(Pass &p) {
