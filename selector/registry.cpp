@@ -26,17 +26,6 @@ void stamp_activity(SelFdEntry *entry) {
         gettimeofday(&entry->lastActivity, nullptr);
 }
 
-uint32_t epoll_events_for(unsigned events) {
-    uint32_t mask = 0;
-    if (events & SEL_READ)
-        mask |= EPOLLIN;
-    if (events & SEL_WRITE)
-        mask |= EPOLLOUT;
-    if (events & SEL_EXCEPT)
-        mask |= EPOLLERR | EPOLLHUP;
-    return mask;
-}
-
 void set_interest(SelContext *ctx, int fd, unsigned events) {
     if (events & SEL_READ)
         FD_SET(fd, &ctx->readSet);
@@ -81,18 +70,6 @@ void drop_pending_events(SelContext *ctx, int fd) {
     for (int i = ctx->epollBatchNext; i < ctx->epollBatchEnd; ++i)
         if (batch[i].data.fd == fd)
             batch[i].data.fd = -1;
-}
-
-int add_to_epoll(int epfd, int fd, unsigned events) {
-    struct epoll_event ev;
-    memset(&ev, 0, sizeof ev);
-    ev.events = epoll_events_for(events);
-    ev.data.fd = fd;
-    if (epoll_ctl(epfd, EPOLL_CTL_ADD, fd, &ev) != 0) {
-        errno = EBUSY;
-        return -1;
-    }
-    return 0;
 }
 
 } // namespace
@@ -144,8 +121,13 @@ int SelAddFD(int fd, unsigned int events, int idleTracked, SelFdCallback callbac
     entry->arg = arg;
     stamp_activity(entry);
 
-    if (epfd != 0)
-        return add_to_epoll(epfd, fd, events);
+    if (epfd != 0) {
+        if (epoll_instance_add(epfd, fd, events) != 0) {
+            errno = EBUSY; // the entry stays filled until SelRemFD
+            return -1;
+        }
+        return 0;
+    }
 
     set_interest(ctx, fd, events);
     if (events != 0 && fd >= ctx->nfds)
@@ -173,7 +155,7 @@ int SelRemFD(int fd) {
     }
     if (epfd != 0) {
         drop_pending_events(ctx, fd);
-        if (epoll_ctl(epfd, EPOLL_CTL_DEL, fd, nullptr) != 0) {
+        if (epoll_instance_remove(epfd, fd) != 0) {
             errno = EINVAL;
             return -1;
         }
