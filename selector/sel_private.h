@@ -12,8 +12,6 @@
 #include <atomic>
 #endif
 
-#define QORBU_HIDDEN __attribute__((visibility("hidden")))
-
 #ifdef __cplusplus
 extern "C" {
 #endif
@@ -76,24 +74,24 @@ static_assert(offsetof(SelContext, passCount) == 928);
 static inline SelContext *SelCurrentContext(void) {
     return (SelContext *)pthread_getspecific(sel_tl_key);
 }
-QORBU_HIDDEN void SelCreateKey(void);
-QORBU_HIDDEN void SelFreeContext(void *context);
+void SelCreateKey(void);
+void SelFreeContext(void *context);
 
-QORBU_HIDDEN int SelTimerBefore(const struct timespec *a, const struct timespec *b);
-QORBU_HIDDEN void SelHeapUp(SelContext *ctx, uint32_t slot);
-QORBU_HIDDEN void SelHeapDown(SelContext *ctx, uint32_t slot);
-QORBU_HIDDEN int SelRunTimers(SelContext *ctx);
+int SelTimerBefore(const struct timespec *a, const struct timespec *b);
+void SelHeapUp(SelContext *ctx, uint32_t slot);
+void SelHeapDown(SelContext *ctx, uint32_t slot);
+int SelRunTimers(SelContext *ctx);
 
-QORBU_HIDDEN SelFdEntry *SelFdSlot(SelContext *ctx, int fd);
+SelFdEntry *SelFdSlot(SelContext *ctx, int fd);
 /* The entry of fd when the table reaches it, else null; never grows it. */
 static inline SelFdEntry *SelFdFind(SelContext *ctx, int fd) {
     return fd >= 0 && fd < ctx->fdTableSize ? &ctx->fdTable[fd] : (SelFdEntry *)0;
 }
-QORBU_HIDDEN void SelDispatchFD(SelContext *ctx, int fd, unsigned int event);
+void SelDispatchFD(SelContext *ctx, int fd, unsigned int event);
 
-QORBU_HIDDEN int SelReapIdleFDs(SelTimer *timer);
+int SelReapIdleFDs(SelTimer *timer);
 
-QORBU_HIDDEN void SelDrainHostQueue(void *hostContext);
+void SelDrainHostQueue(void *hostContext);
 
 #ifdef __cplusplus
 }
@@ -110,15 +108,15 @@ inline constexpr int kTimerMisuse = -117;
 inline constexpr int kErestart = 85;
 
 /* The process-wide epoll instance; 0 means select mode. */
-QORBU_HIDDEN extern std::atomic<int> epoll_fd;
+extern std::atomic<int> epoll_fd;
 inline int current_epoll_fd() { return epoll_fd.load(std::memory_order_relaxed); }
 
 /* The reaper timer is armed in one live thread's heap at a time: the
  * owner's. When the owner's thread ends, the next pass of any selector
  * thread takes the reaper over; a pass pays one relaxed load for this. */
-QORBU_HIDDEN extern std::atomic<SelContext *> reaper_owner;
-QORBU_HIDDEN void arm_reaper_if_free(SelContext *ctx);
-QORBU_HIDDEN void release_reaper(SelContext *ctx);
+extern std::atomic<SelContext *> reaper_owner;
+void arm_reaper_if_free(SelContext *ctx);
+void release_reaper(SelContext *ctx);
 inline void adopt_orphaned_reaper(SelContext *ctx) {
     if (reaper_owner.load(std::memory_order_relaxed) == nullptr) arm_reaper_if_free(ctx);
 }
@@ -137,16 +135,16 @@ inline uint32_t begin_pass(SelContext *ctx) {
  * event bits. wait unblocks the signals in unblocked (if any) for the wait
  * only, and leaves in each event's events field the selector's one bit for
  * it: SEL_READ when readable, else SEL_WRITE when writable, else SEL_EXCEPT. */
-QORBU_HIDDEN int epoll_instance_create();
-QORBU_HIDDEN int epoll_instance_add(int epfd, int fd, unsigned int events);
-QORBU_HIDDEN int epoll_instance_remove(int epfd, int fd);
-QORBU_HIDDEN int epoll_instance_wait(int epfd, struct epoll_event *events, int max_events, int timeout_ms,
+int epoll_instance_create();
+int epoll_instance_add(int epfd, int fd, unsigned int events);
+int epoll_instance_remove(int epfd, int fd);
+int epoll_instance_wait(int epfd, struct epoll_event *events, int max_events, int timeout_ms,
                                      const sigset_t *unblocked);
 
 /* One SelEpoll pass. The run loop of the green threads passes true: with no
  * timer armed it sleeps until a descriptor or a signal wakes it, where
  * SelEpoll itself does not wait at all. */
-QORBU_HIDDEN int epoll_pass(bool sleepWithoutTimer);
+int epoll_pass(bool sleepWithoutTimer);
 
 } // namespace qorbu::sel
 #endif
