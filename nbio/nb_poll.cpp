@@ -1,6 +1,6 @@
 /* nb_poll: park the calling green thread in the selector until a descriptor
  * is ready or an optional time-out expires. */
-#include <errno.h>
+#include <cerrno>
 #include <poll.h>
 
 #include "greenthreads/greenthread_private.h"
@@ -83,21 +83,21 @@ extern "C" int nb_poll(int fd, int events, int timeout)
 {
     NbWait wait = {current_greenthread(), 0};
     const unsigned int mask = nb::selector_mask(events);
-    const bool watchDescriptor = mask != 0;
-    if (!watchDescriptor && timeout <= 0) {
+    const bool watch_descriptor = mask != 0;
+    if (!watch_descriptor && timeout <= 0) {
         errno = EINVAL; /* nothing could ever end this wait */
         return -1;
     }
     /* A descriptor the selector refuses (invalid, out of its range, already
      * registered) could never wake us: fail at once with its errno. */
-    if (watchDescriptor && SelAddFD(fd, mask, 0, nb_poll_on_ready, &wait) != 0) {
+    if (watch_descriptor && SelAddFD(fd, mask, 0, nb_poll_on_ready, &wait) != 0) {
         nb::forget_refused_registration(fd, wait);
         return -1;
     }
     SelTimer timer = {};
     if (timeout > 0 && nb::arm_timeout(timer, wait, timeout) != 0) {
         const int saved = errno;
-        if (watchDescriptor)
+        if (watch_descriptor)
             SelRemFD(fd);
         errno = saved;
         return -1;
@@ -105,7 +105,7 @@ extern "C" int nb_poll(int fd, int events, int timeout)
     nb::wait_for_result(wait);
     if (timeout > 0)
         SelRemTimer(&timer);
-    if (watchDescriptor)
+    if (watch_descriptor)
         SelRemFD(fd);
     return wait.result;
 }

@@ -3,7 +3,7 @@
 #ifndef QORBU_NBIO_NB_PRIVATE_H
 #define QORBU_NBIO_NB_PRIVATE_H
 
-#include <stdint.h>
+#include <cstdint>
 
 #include "greenthreads/greenthread.h"
 #include "nbio/nb.h"

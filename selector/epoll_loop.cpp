@@ -36,7 +36,7 @@ int epoll_timeout_ms(const SelContext *ctx, const struct timespec &now) {
     return ms > INT_MAX ? INT_MAX : static_cast<int>(ms);
 }
 
-int epoll_pass(bool sleepWithoutTimer) {
+int epoll_pass(bool sleep_without_timer) {
     /* 1. The thread's context; the pass is counted, so that a nested pass
      *    run by a callback ends the dispatch below. */
     SelContext *ctx = SelCurrentContext();
@@ -55,7 +55,7 @@ int epoll_pass(bool sleepWithoutTimer) {
          *    one, unless the run loop asks to sleep), the registered signals
          *    unblocked for the wait only. */
         const bool timer_armed = ctx->timerCount > 0 && ctx->timerHeap[1];
-        const int timeout_ms = sleepWithoutTimer && !timer_armed ? -1 : epoll_timeout_ms(ctx, now);
+        const int timeout_ms = sleep_without_timer && !timer_armed ? -1 : epoll_timeout_ms(ctx, now);
         n = epoll_instance_wait(epfd, events, kEpollBlockingBatch, timeout_ms, &ctx->signals);
     }
 
@@ -71,20 +71,20 @@ int epoll_pass(bool sleepWithoutTimer) {
      *    registered anew meanwhile), and once a callback has run a nested
      *    pass, which served what was left, the rest of the batch is stale.
      *    The running batch is saved around the loop for the pass it nests in. */
-    struct epoll_event *const outerBatch = ctx->epollBatch;
-    const int32_t outerNext = ctx->epollBatchNext, outerEnd = ctx->epollBatchEnd;
-    ctx->epollBatch = events;
-    ctx->epollBatchEnd = n;
-    for (int i = 0; i < n && ctx->passCount == pass; ++i) {
-        ctx->epollBatchNext = i + 1;
+    struct epoll_event *const outer_batch = ctx->epoll_batch;
+    const int32_t outer_next = ctx->epoll_batch_next, outer_end = ctx->epoll_batch_end;
+    ctx->epoll_batch = events;
+    ctx->epoll_batch_end = n;
+    for (int i = 0; i < n && ctx->pass_count == pass; ++i) {
+        ctx->epoll_batch_next = i + 1;
         const int fd = events[i].data.fd;
         SelFdEntry *entry = SelFdFind(ctx, fd);
         if (!entry || entry->events == 0) continue;
         entry->callback(fd, events[i].events, entry->arg, entry);
     }
-    ctx->epollBatch = outerBatch;
-    ctx->epollBatchNext = outerNext;
-    ctx->epollBatchEnd = outerEnd;
+    ctx->epoll_batch = outer_batch;
+    ctx->epoll_batch_next = outer_next;
+    ctx->epoll_batch_end = outer_end;
 
     /* 7. Fire the due timers (the expiry run reads the clock itself). */
     SelRunTimers(ctx);

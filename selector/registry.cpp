@@ -1,10 +1,10 @@
 // The per-thread descriptor registry: one entry per descriptor number, the
 // select-mode interest sets and nfds, or the process-wide epoll instance.
-#include <errno.h>
+#include <cerrno>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
 #include <fcntl.h>
-#include <stdint.h>
-#include <stdlib.h>
-#include <string.h>
 #include <sys/epoll.h>
 #include <sys/time.h>
 
@@ -64,10 +64,10 @@ bool is_open_descriptor(int fd) { return fcntl(fd, F_GETFD) != -1 || errno != EB
 // Events of the running epoll batch that are still to come for fd are not
 // dispatched: they were meant for the registration just removed.
 void drop_pending_events(SelContext *ctx, int fd) {
-    struct epoll_event *batch = ctx->epollBatch;
+    struct epoll_event *batch = ctx->epoll_batch;
     if (batch == nullptr)
         return;
-    for (int i = ctx->epollBatchNext; i < ctx->epollBatchEnd; ++i)
+    for (int i = ctx->epoll_batch_next; i < ctx->epoll_batch_end; ++i)
         if (batch[i].data.fd == fd)
             batch[i].data.fd = -1;
 }

@@ -36,12 +36,12 @@ typedef struct SelContext {
     fd_set readyRead;   /* working sets of the current wait */
     fd_set readyWrite;
     fd_set readyExcept;
-    uint32_t passCount; /* passes started in this thread, nested ones included */
+    uint32_t pass_count; /* passes started in this thread, nested ones included */
     /* The events of the running epoll pass, and the first not yet
      * dispatched: SelRemFD drops a removed descriptor's events from it. */
-    struct epoll_event *epollBatch;
-    int32_t epollBatchNext;
-    int32_t epollBatchEnd;
+    struct epoll_event *epoll_batch;
+    int32_t epoll_batch_next;
+    int32_t epoll_batch_end;
 } SelContext;
 
 #ifdef __cplusplus
@@ -63,7 +63,7 @@ static_assert(offsetof(SelContext, timerCapacity) == 536 && offsetof(SelContext,
 static_assert(offsetof(SelContext, readyRead) == 544 && offsetof(SelContext, readyWrite) == 672);
 static_assert(offsetof(SelContext, readyExcept) == 800);
 /* Later fields are appended behind the ones above, which keep their places. */
-static_assert(offsetof(SelContext, passCount) == 928);
+static_assert(offsetof(SelContext, pass_count) == 928);
 #endif
 #endif
 
@@ -125,7 +125,7 @@ inline void adopt_orphaned_reaper(SelContext *ctx) {
  * nested pass) and takes an orphaned reaper over. Returns the pass number. */
 inline uint32_t begin_pass(SelContext *ctx) {
     adopt_orphaned_reaper(ctx);
-    return ++ctx->passCount;
+    return ++ctx->pass_count;
 }
 
 /* The epoll backend (epoll.cpp): calls on an epoll instance that know
@@ -144,7 +144,7 @@ int epoll_instance_wait(int epfd, struct epoll_event *events, int max_events, in
 /* One SelEpoll pass. The run loop of the green threads passes true: with no
  * timer armed it sleeps until a descriptor or a signal wakes it, where
  * SelEpoll itself does not wait at all. */
-int epoll_pass(bool sleepWithoutTimer);
+int epoll_pass(bool sleep_without_timer);
 
 } // namespace qorbu::sel
 #endif

@@ -148,12 +148,12 @@ extern "C" QORBU_API int zarn_select(int nfds, fd_set *readfds, fd_set *writefds
     clear_if_present(exceptfds);
 
     const int result = SelSelect();
-    const int passErrno = errno;
+    const int pass_errno = errno;
 
     remove_ours(nfds, &ours);
     if (armed) SelRemTimer(&timer);
     if (result < 0) {
-        errno = passErrno;
+        errno = pass_errno;
         return -1;
     }
     return wait.readyCount;

@@ -71,7 +71,8 @@ int ask_snmp(SelContext *ctx, SnmpInfo *snmp, int width) {
 bool snmp_descriptor_reported(const SelContext *ctx, const SnmpInfo &snmp) {
     const int limit = clamp_to_set_size(snmp.count);
     for (int i = 0; i * kFdWordBits < limit; ++i)
-        if (fd_word(&ctx->readyRead, i) & fd_word(&snmp.read_set, i) & fd_word_mask_below(i, limit)) return true;
+        if (fd_word(&ctx->readyRead, i) & fd_word(&snmp.read_set, i) & fd_word_mask_below(i, limit))
+            return true;
     return false;
 }
 
@@ -138,7 +139,7 @@ bool any_exceptional_reported(const SelContext *ctx) {
  * and those of descriptors removed meanwhile. */
 int dispatch_ready(SelContext *ctx, int ready, uint32_t pass) {
     const int limit = clamp_to_set_size(ctx->nfds);
-    auto spent = [&] { return ctx->passCount != pass || --ready == 0; };
+    auto spent = [&] { return ctx->pass_count != pass || --ready == 0; };
 
     if (any_exceptional_reported(ctx)) {
         for (int fd = next_exceptional(ctx, 0, limit); fd >= 0; fd = next_exceptional(ctx, fd + 1, limit)) {
@@ -157,7 +158,8 @@ int dispatch_ready(SelContext *ctx, int ready, uint32_t pass) {
     /* One stretch of the round: true once nothing more is to be dispatched. */
     auto scan = [&](int from, int to) {
         for (int fd = next_read_write(ctx, from, to); fd >= 0; fd = next_read_write(ctx, fd + 1, to)) {
-            if (FD_ISSET(fd, &ctx->readyRead) && FD_ISSET(fd, &ctx->readSet) && dispatch_read_write(fd, SEL_READ))
+            if (FD_ISSET(fd, &ctx->readyRead) && FD_ISSET(fd, &ctx->readSet) &&
+                dispatch_read_write(fd, SEL_READ))
                 return true;
             if (FD_ISSET(fd, &ctx->readyWrite) && FD_ISSET(fd, &ctx->writeSet) &&
                 dispatch_read_write(fd, SEL_WRITE))
@@ -182,8 +184,8 @@ unsigned long printed_word(const fd_set *set, int i) {
 
 void print_einval_diagnostic(const SelContext *ctx, int width, const SnmpInfo &snmp,
                              const struct timespec &timeout) {
-    fprintf(stderr, "invalid params in select %d tl fd %d snmp fd %d fdsetsize %d ", width, ctx->nfds, snmp.count,
-            kSelectSetSize);
+    fprintf(stderr, "invalid params in select %d tl fd %d snmp fd %d fdsetsize %d ", width, ctx->nfds,
+            snmp.count, kSelectSetSize);
     fprintf(stderr, "timeval %d:%d \n", static_cast<int>(timeout.tv_sec), static_cast<int>(timeout.tv_nsec));
     for (int i = 0; i < kSelectSetSize / kPrintedWordBits; ++i) {
         fprintf(stderr, "selreadset %d %lx\t", i, printed_word(&ctx->readyRead, i));
@@ -352,6 +354,7 @@ extern "C" QORBU_API int SelSelect(void) {
         if (snmp_timeout) snmp_timeout();
         if (run_alarms) run_alarms();
     }
-    if (reported > 0 && ready > 0 && snmp_read && snmp_descriptor_reported(ctx, snmp)) snmp_read(&ctx->readyRead);
+    if (reported > 0 && ready > 0 && snmp_read && snmp_descriptor_reported(ctx, snmp))
+        snmp_read(&ctx->readyRead);
     return 0;
 }

@@ -1,11 +1,11 @@
 // Monotonic timers kept in a per-thread binary min-heap of caller-owned
 // records. Slot 0 of the heap array is not part of the heap: the expiry run
 // parks the timer it is firing there.
-#include <errno.h>
-#include <signal.h>
-#include <stdint.h>
-#include <stdio.h>
-#include <stdlib.h>
+#include <cerrno>
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
 #include <unistd.h>
 
 #include <limits>

@@ -1,7 +1,7 @@
-#include <errno.h>
+#include <cerrno>
+#include <csignal>
+#include <cstddef>
 #include <pthread.h>
-#include <signal.h>
-#include <stddef.h>
 
 #include <atomic>
 #include <thread>
