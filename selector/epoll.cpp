@@ -1,17 +1,13 @@
 /* The epoll backend: the only code that creates, changes or waits on an
  * epoll instance. It knows descriptors and the selector's event bits, and
  * nothing of the registry or of the passes that call it. */
-#include <sys/epoll.h>
-
 #include <cerrno>
-#include <csignal>
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
-#include <pthread.h>
 #include <unistd.h>
 
-#include "selector/sel_private.h"
+#include "selector/epoll_private.h"
 
 namespace qorbu::sel {
 
@@ -42,23 +38,8 @@ int epoll_instance_add(int epfd, int fd, unsigned int events) {
 
 int epoll_instance_remove(int epfd, int fd) { return epoll_ctl(epfd, EPOLL_CTL_DEL, fd, nullptr); }
 
-int epoll_instance_wait(int epfd, struct epoll_event *events, int max_events, int timeout_ms,
-                        const sigset_t *unblocked) {
-    sigset_t previous;
-    if (unblocked) pthread_sigmask(SIG_UNBLOCK, unblocked, &previous);
-    const int n = epoll_wait(epfd, events, max_events, timeout_ms);
-    if (unblocked) {
-        const int wait_errno = errno;
-        pthread_sigmask(SIG_SETMASK, &previous, nullptr);
-        errno = wait_errno;
-    }
-    /* One selector bit per event: reading before writing before the rest
-     * (an error or a hang-up alone). */
-    for (int i = 0; i < n; ++i) {
-        const uint32_t flags = events[i].events;
-        events[i].events = (flags & EPOLLIN) ? SEL_READ : (flags & EPOLLOUT) ? SEL_WRITE : SEL_EXCEPT;
-    }
-    return n;
+int epoll_instance_wait(int epfd, struct epoll_event *events, int max_events, int timeout_ms) {
+    return epoll_wait(epfd, events, max_events, timeout_ms);
 }
 
 } // namespace qorbu::sel

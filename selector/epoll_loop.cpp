@@ -1,15 +1,16 @@
 /* Epoll mode: switching the process to it, and SelEpoll, one pass of the
  * loop that waits on the process-wide instance (epoll.cpp) instead of
  * pselect. */
-#include <sys/epoll.h>
-
 #include <cerrno>
 #include <climits>
+#include <csignal>
 #include <cstdio>
 #include <cstdlib>
+#include <pthread.h>
 #include <unistd.h>
 
 #include "selector/dispatch_private.h"
+#include "selector/epoll_private.h"
 #include "selector/time_private.h"
 
 using namespace qorbu::sel;
@@ -45,7 +46,7 @@ int epoll_pass(bool sleep_without_timer) {
     struct epoll_event events[kEpollBatch];
 
     /* 2. Take up to kEpollBatch ready events without blocking. */
-    int n = epoll_instance_wait(epfd, events, kEpollBatch, 0, nullptr);
+    int n = epoll_instance_wait(epfd, events, kEpollBatch, 0);
     if (n == 0) {
         /* 3. Nothing ready: fire the due timers; a pass that fired any ends here. */
         struct timespec now;
@@ -56,7 +57,12 @@ int epoll_pass(bool sleep_without_timer) {
          *    unblocked for the wait only. */
         const bool timer_armed = ctx->timerCount > 0 && ctx->timerHeap[1];
         const int timeout_ms = sleep_without_timer && !timer_armed ? -1 : epoll_timeout_ms(ctx, now);
-        n = epoll_instance_wait(epfd, events, kEpollBlockingBatch, timeout_ms, &ctx->signals);
+        sigset_t previous;
+        pthread_sigmask(SIG_UNBLOCK, &ctx->signals, &previous);
+        n = epoll_instance_wait(epfd, events, kEpollBlockingBatch, timeout_ms);
+        const int wait_errno = errno;
+        pthread_sigmask(SIG_SETMASK, &previous, nullptr);
+        errno = wait_errno;
     }
 
     /* 5. An interrupted wait returns -1; any other failure ends the process. */
@@ -80,7 +86,7 @@ int epoll_pass(bool sleep_without_timer) {
         const int fd = events[i].data.fd;
         SelFdEntry *entry = SelFdFind(ctx, fd);
         if (!entry || entry->events == 0) continue;
-        entry->callback(fd, events[i].events, entry->arg, entry);
+        entry->callback(fd, selector_event(events[i].events), entry->arg, entry);
     }
     ctx->epoll_batch = outer_batch;
     ctx->epoll_batch_next = outer_next;

@@ -5,9 +5,9 @@
 #include <cstdlib>
 #include <cstring>
 #include <fcntl.h>
-#include <sys/epoll.h>
 #include <sys/time.h>
 
+#include "selector/epoll_private.h"
 #include "selector/sel_private.h"
 
 using namespace qorbu::sel;

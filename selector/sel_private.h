@@ -128,19 +128,6 @@ inline uint32_t begin_pass(SelContext *ctx) {
     return ++ctx->pass_count;
 }
 
-/* The epoll backend (epoll.cpp): calls on an epoll instance that know
- * nothing of the registry or the passes. Each answers as the system call it
- * makes: a count or 0, or -1 with the kernel's errno. The instance is
- * created close-on-exec and never at descriptor 0; add takes the selector's
- * event bits. wait unblocks the signals in unblocked (if any) for the wait
- * only, and leaves in each event's events field the selector's one bit for
- * it: SEL_READ when readable, else SEL_WRITE when writable, else SEL_EXCEPT. */
-int epoll_instance_create();
-int epoll_instance_add(int epfd, int fd, unsigned int events);
-int epoll_instance_remove(int epfd, int fd);
-int epoll_instance_wait(int epfd, struct epoll_event *events, int max_events, int timeout_ms,
-                                     const sigset_t *unblocked);
-
 /* One SelEpoll pass. The run loop of the green threads passes true: with no
  * timer armed it sleeps until a descriptor or a signal wakes it, where
  * SelEpoll itself does not wait at all. */
