@@ -3,9 +3,7 @@
 #ifndef QORBU_GREENTHREADS_GREENTHREAD_H
 #define QORBU_GREENTHREADS_GREENTHREAD_H
 
-#ifndef QORBU_API
-#define QORBU_API __attribute__((visibility("default")))
-#endif
+#include "qorbu_api.h"
 
 #ifdef __cplusplus
 extern "C" {

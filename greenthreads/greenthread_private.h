@@ -9,10 +9,6 @@
 
 #include "greenthreads/greenthread.h"
 
-#ifndef QORBU_HIDDEN
-#define QORBU_HIDDEN __attribute__((visibility("hidden")))
-#endif
-
 /* Which sanitizer has to be told about stack switches. */
 #if defined(__SANITIZE_ADDRESS__)
 #define QORBU_GT_ASAN 1
@@ -67,32 +63,32 @@ inline constexpr size_t kStackSize = 16384;
 
 /* Process-wide scheduler state; only the thread that called
  * greenthreads_init touches it. */
-QORBU_HIDDEN extern Greenthread *run_queue_head;
-QORBU_HIDDEN extern Greenthread *run_queue_tail;
-QORBU_HIDDEN extern Greenthread *current_thread;
-QORBU_HIDDEN extern Greenthread *free_threads;
-QORBU_HIDDEN extern Greenthread *main_thread;
-QORBU_HIDDEN extern long page_size;
-QORBU_HIDDEN extern int live_threads;
+extern Greenthread *run_queue_head;
+extern Greenthread *run_queue_tail;
+extern Greenthread *current_thread;
+extern Greenthread *free_threads;
+extern Greenthread *main_thread;
+extern long page_size;
+extern int live_threads;
 
-QORBU_HIDDEN void run_queue_append(Greenthread *thread);
-[[noreturn]] QORBU_HIDDEN void greenthread_start();
+void run_queue_append(Greenthread *thread);
+[[noreturn]] void greenthread_start();
 
 /* One turn of the run loop: hand the processor to the queued threads if
  * there are any, otherwise wait once in the selector. */
-QORBU_HIDDEN void run_one_turn();
+void run_one_turn();
 
 /* True in the main context, and before greenthreads_init: there the caller
  * must not block, it has to drive the run loop itself. */
 inline bool in_main_context() { return current_thread == main_thread; }
 
 /* Stacks (stack.cpp). */
-QORBU_HIDDEN size_t stack_mapping_length(long pageSize);
-QORBU_HIDDEN bool process_wants_executable_stack();
+size_t stack_mapping_length(long pageSize);
+bool process_wants_executable_stack();
 /* Maps a stack of stack_mapping_length() bytes whose lowest page is the
  * guard page; null (errno set) when the mapping fails. */
-QORBU_HIDDEN void *stack_map();
-QORBU_HIDDEN void stack_unmap(void *base);
+void *stack_map();
+void stack_unmap(void *base);
 
 } // namespace qorbu::gt
 

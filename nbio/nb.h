@@ -7,9 +7,7 @@
 #include <stddef.h>
 #include <sys/socket.h>
 
-#ifndef QORBU_API
-#define QORBU_API __attribute__((visibility("default")))
-#endif
+#include "qorbu_api.h"
 
 #ifdef __cplusplus
 extern "C" {

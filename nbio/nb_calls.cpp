@@ -1,7 +1,7 @@
 /* Blocking-style descriptor calls for green threads: each tries the system
  * call first and waits in nb_poll only when the descriptor would block. */
-#include <errno.h>
-#include <limits.h>
+#include <cerrno>
+#include <climits>
 #include <poll.h>
 #include <sys/socket.h>
 #include <unistd.h>

@@ -1,16 +1,14 @@
 /* nb_poll: park the calling green thread in the selector until a descriptor
  * is ready or an optional time-out expires. */
-#include <errno.h>
+#include <cerrno>
 #include <poll.h>
 
 #include "greenthreads/greenthread_private.h"
 #include "nbio/nb_private.h"
+#include "selector/time_private.h"
 
 namespace qorbu::nb {
 namespace {
-
-constexpr long kNsecPerMsec = 1000000;
-constexpr int kMsecPerSec = 1000;
 
 /* Blocks the green thread until a callback has set the result; a wakeup
  * from elsewhere that leaves it at 0 blocks again. The main context may not
@@ -42,7 +40,8 @@ int arm_timeout(SelTimer &timer, NbWait &wait, int timeout)
     timer.heapIndex = 0;
     timer.callback = nb_poll_on_timeout;
     timer.arg = &wait;
-    SelMakeWhen(&timer.when, timeout / kMsecPerSec, (timeout % kMsecPerSec) * kNsecPerMsec);
+    const struct timespec span = sel::ms_to_timespec(timeout);
+    SelMakeWhen(&timer.when, static_cast<long>(span.tv_sec), span.tv_nsec);
     return SelAddTimer(&timer) == 0 ? 0 : -1;
 }
 
@@ -84,21 +83,21 @@ extern "C" int nb_poll(int fd, int events, int timeout)
 {
     NbWait wait = {current_greenthread(), 0};
     const unsigned int mask = nb::selector_mask(events);
-    const bool watchDescriptor = mask != 0;
-    if (!watchDescriptor && timeout <= 0) {
+    const bool watch_descriptor = mask != 0;
+    if (!watch_descriptor && timeout <= 0) {
         errno = EINVAL; /* nothing could ever end this wait */
         return -1;
     }
     /* A descriptor the selector refuses (invalid, out of its range, already
      * registered) could never wake us: fail at once with its errno. */
-    if (watchDescriptor && SelAddFD(fd, mask, 0, nb_poll_on_ready, &wait) != 0) {
+    if (watch_descriptor && SelAddFD(fd, mask, 0, nb_poll_on_ready, &wait) != 0) {
         nb::forget_refused_registration(fd, wait);
         return -1;
     }
     SelTimer timer = {};
     if (timeout > 0 && nb::arm_timeout(timer, wait, timeout) != 0) {
         const int saved = errno;
-        if (watchDescriptor)
+        if (watch_descriptor)
             SelRemFD(fd);
         errno = saved;
         return -1;
@@ -106,7 +105,7 @@ extern "C" int nb_poll(int fd, int events, int timeout)
     nb::wait_for_result(wait);
     if (timeout > 0)
         SelRemTimer(&timer);
-    if (watchDescriptor)
+    if (watch_descriptor)
         SelRemFD(fd);
     return wait.result;
 }

@@ -3,15 +3,11 @@
 #ifndef QORBU_NBIO_NB_PRIVATE_H
 #define QORBU_NBIO_NB_PRIVATE_H
 
-#include <stdint.h>
+#include <cstdint>
 
 #include "greenthreads/greenthread.h"
 #include "nbio/nb.h"
 #include "selector/sel.h"
-
-#ifndef QORBU_HIDDEN
-#define QORBU_HIDDEN __attribute__((visibility("hidden")))
-#endif
 
 /* One wait of nb_poll: lives on the waiting thread's stack and is the
  * argument of both selector callbacks. */
@@ -24,14 +20,14 @@ typedef struct NbWait {
 static_assert(sizeof(NbWait) == 8, "NbWait is two 32-bit words on 32-bit targets");
 #endif
 
-QORBU_HIDDEN int nb_poll_on_ready(int fd, unsigned int event, void *arg, SelFdEntry *entry);
-QORBU_HIDDEN int nb_poll_on_timeout(SelTimer *timer);
+int nb_poll_on_ready(int fd, unsigned int event, void *arg, SelFdEntry *entry);
+int nb_poll_on_timeout(SelTimer *timer);
 
 namespace qorbu::nb {
 
 /* The selector mask for nb_poll's poll(2)-style event bits: POLLIN and
  * POLLOUT count, every other bit is ignored. */
-QORBU_HIDDEN unsigned int selector_mask(int events);
+unsigned int selector_mask(int events);
 
 } // namespace qorbu::nb
 

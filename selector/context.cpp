@@ -1,9 +1,9 @@
 // Per-thread selector contexts: creation, the thread-local key, the host
 // context hand-over and the signals that may interrupt a wait.
-#include <errno.h>
-#include <signal.h>
-#include <stdlib.h>
-#include <string.h>
+#include <cerrno>
+#include <csignal>
+#include <cstdlib>
+#include <cstring>
 
 #include "selector/sel_private.h"
 

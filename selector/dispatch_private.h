@@ -34,14 +34,10 @@ inline constexpr int kEinvalFailuresTolerated = 4; /* the fifth one aborts */
 inline constexpr int kEpollBatch = 100;            /* events taken by the non-blocking wait */
 inline constexpr int kEpollBlockingBatch = 1;      /* events taken by the blocking wait */
 inline constexpr int kPrintedWordBits = 32;        /* the EINVAL diagnostic prints 32-bit words */
-inline constexpr long kNsecPerSec = 1000000000L;
-inline constexpr long kNsecPerUsec = 1000L;
-inline constexpr long kNsecPerMsec = 1000000L;
-inline constexpr long kMsecPerSec = 1000L;
 
 /* Waits that failed with EINVAL since the last read/write scan that ended
  * with ready pairs left over; shared by every selector thread. */
-QORBU_HIDDEN extern std::atomic<int> sel_einval_count;
+extern std::atomic<int> sel_einval_count;
 
 /* All six host scheduler functions are present in the process. */
 inline bool host_functions_present() {
@@ -54,7 +50,7 @@ inline bool snmp_present() { return snmp_select_info != nullptr; }
 
 /* The blocking epoll wait's time-out: milliseconds from now until the
  * earliest timer, truncated; 0 when no timer is armed. */
-QORBU_HIDDEN int epoll_timeout_ms(const SelContext *ctx, const struct timespec &now);
+int epoll_timeout_ms(const SelContext *ctx, const struct timespec &now);
 
 /* --- descriptor sets, a machine word at a time ---------------------------- */
 

@@ -1,7 +1,7 @@
 // The idle-descriptor reaper: a timer that closes descriptors registered
 // with idle tracking once nothing has happened on them for a while.
 #include <atomic>
-#include <stdlib.h>
+#include <cstdlib>
 #include <sys/time.h>
 #include <unistd.h>
 

@@ -1,13 +1,13 @@
 // The per-thread descriptor registry: one entry per descriptor number, the
 // select-mode interest sets and nfds, or the process-wide epoll instance.
-#include <errno.h>
+#include <cerrno>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
 #include <fcntl.h>
-#include <stdint.h>
-#include <stdlib.h>
-#include <string.h>
-#include <sys/epoll.h>
 #include <sys/time.h>
 
+#include "selector/epoll_private.h"
 #include "selector/sel_private.h"
 
 using namespace qorbu::sel;
@@ -24,17 +24,6 @@ constexpr size_t kMaxTableEntries = SIZE_MAX / sizeof(SelFdEntry);
 void stamp_activity(SelFdEntry *entry) {
     if (entry->idleTracked == 1)
         gettimeofday(&entry->lastActivity, nullptr);
-}
-
-uint32_t epoll_events_for(unsigned events) {
-    uint32_t mask = 0;
-    if (events & SEL_READ)
-        mask |= EPOLLIN;
-    if (events & SEL_WRITE)
-        mask |= EPOLLOUT;
-    if (events & SEL_EXCEPT)
-        mask |= EPOLLERR | EPOLLHUP;
-    return mask;
 }
 
 void set_interest(SelContext *ctx, int fd, unsigned events) {
@@ -75,24 +64,12 @@ bool is_open_descriptor(int fd) { return fcntl(fd, F_GETFD) != -1 || errno != EB
 // Events of the running epoll batch that are still to come for fd are not
 // dispatched: they were meant for the registration just removed.
 void drop_pending_events(SelContext *ctx, int fd) {
-    struct epoll_event *batch = ctx->epollBatch;
+    struct epoll_event *batch = ctx->epoll_batch;
     if (batch == nullptr)
         return;
-    for (int i = ctx->epollBatchNext; i < ctx->epollBatchEnd; ++i)
+    for (int i = ctx->epoll_batch_next; i < ctx->epoll_batch_end; ++i)
         if (batch[i].data.fd == fd)
             batch[i].data.fd = -1;
-}
-
-int add_to_epoll(int epfd, int fd, unsigned events) {
-    struct epoll_event ev;
-    memset(&ev, 0, sizeof ev);
-    ev.events = epoll_events_for(events);
-    ev.data.fd = fd;
-    if (epoll_ctl(epfd, EPOLL_CTL_ADD, fd, &ev) != 0) {
-        errno = EBUSY;
-        return -1;
-    }
-    return 0;
 }
 
 } // namespace
@@ -144,8 +121,13 @@ int SelAddFD(int fd, unsigned int events, int idleTracked, SelFdCallback callbac
     entry->arg = arg;
     stamp_activity(entry);
 
-    if (epfd != 0)
-        return add_to_epoll(epfd, fd, events);
+    if (epfd != 0) {
+        if (epoll_instance_add(epfd, fd, events) != 0) {
+            errno = EBUSY; // the entry stays filled until SelRemFD
+            return -1;
+        }
+        return 0;
+    }
 
     set_interest(ctx, fd, events);
     if (events != 0 && fd >= ctx->nfds)
@@ -173,7 +155,7 @@ int SelRemFD(int fd) {
     }
     if (epfd != 0) {
         drop_pending_events(ctx, fd);
-        if (epoll_ctl(epfd, EPOLL_CTL_DEL, fd, nullptr) != 0) {
+        if (epoll_instance_remove(epfd, fd) != 0) {
             errno = EINVAL;
             return -1;
         }

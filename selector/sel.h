@@ -8,9 +8,7 @@
 #include <sys/time.h>
 #include <time.h>
 
-#ifndef QORBU_API
-#define QORBU_API __attribute__((visibility("default")))
-#endif
+#include "qorbu_api.h"
 
 #ifdef __cplusplus
 extern "C" {

@@ -12,8 +12,6 @@
 #include <atomic>
 #endif
 
-#define QORBU_HIDDEN __attribute__((visibility("hidden")))
-
 #ifdef __cplusplus
 extern "C" {
 #endif
@@ -38,13 +36,36 @@ typedef struct SelContext {
     fd_set readyRead;   /* working sets of the current wait */
     fd_set readyWrite;
     fd_set readyExcept;
-    uint32_t passCount; /* passes started in this thread, nested ones included */
+    uint32_t pass_count; /* passes started in this thread, nested ones included */
     /* The events of the running epoll pass, and the first not yet
      * dispatched: SelRemFD drops a removed descriptor's events from it. */
-    struct epoll_event *epollBatch;
-    int32_t epollBatchNext;
-    int32_t epollBatchEnd;
+    struct epoll_event *epoll_batch;
+    int32_t epoll_batch_next;
+    int32_t epoll_batch_end;
 } SelContext;
+
+#ifdef __cplusplus
+static_assert(SEL_READ == 1u && SEL_WRITE == 2u && SEL_EXCEPT == 4u && SEL_IN_CALLBACK == 8u);
+#if UINTPTR_MAX == 0xffffffffu
+/* Debuggers and host tools read these records on the 32-bit targets. */
+static_assert(sizeof(time_t) == 4 && sizeof(long) == 4);
+static_assert(offsetof(SelTimer, heapIndex) == 0 && offsetof(SelTimer, when) == 4);
+static_assert(offsetof(SelTimer, callback) == 12 && offsetof(SelTimer, arg) == 16 && sizeof(SelTimer) == 20);
+static_assert(offsetof(SelFdEntry, events) == 0 && offsetof(SelFdEntry, idleTracked) == 4);
+static_assert(offsetof(SelFdEntry, lastActivity) == 8 && offsetof(SelFdEntry, callback) == 16);
+static_assert(offsetof(SelFdEntry, arg) == 20 && sizeof(SelFdEntry) == 24);
+static_assert(offsetof(SelContext, signals) == 0 && offsetof(SelContext, readSet) == 128);
+static_assert(offsetof(SelContext, writeSet) == 256 && offsetof(SelContext, exceptSet) == 384);
+static_assert(offsetof(SelContext, nfds) == 512 && offsetof(SelContext, scanStart) == 516);
+static_assert(offsetof(SelContext, fdTable) == 520 && offsetof(SelContext, fdTableSize) == 524);
+static_assert(offsetof(SelContext, timerHeap) == 528 && offsetof(SelContext, timerCount) == 532);
+static_assert(offsetof(SelContext, timerCapacity) == 536 && offsetof(SelContext, zg) == 540);
+static_assert(offsetof(SelContext, readyRead) == 544 && offsetof(SelContext, readyWrite) == 672);
+static_assert(offsetof(SelContext, readyExcept) == 800);
+/* Later fields are appended behind the ones above, which keep their places. */
+static_assert(offsetof(SelContext, pass_count) == 928);
+#endif
+#endif
 
 /* Internal operations, hidden from the library's users but linkable by the
  * white-box tests (they link the static archive of the same objects). */
@@ -53,24 +74,24 @@ typedef struct SelContext {
 static inline SelContext *SelCurrentContext(void) {
     return (SelContext *)pthread_getspecific(sel_tl_key);
 }
-QORBU_HIDDEN void SelCreateKey(void);
-QORBU_HIDDEN void SelFreeContext(void *context);
+void SelCreateKey(void);
+void SelFreeContext(void *context);
 
-QORBU_HIDDEN int SelTimerBefore(const struct timespec *a, const struct timespec *b);
-QORBU_HIDDEN void SelHeapUp(SelContext *ctx, uint32_t slot);
-QORBU_HIDDEN void SelHeapDown(SelContext *ctx, uint32_t slot);
-QORBU_HIDDEN int SelRunTimers(SelContext *ctx);
+int SelTimerBefore(const struct timespec *a, const struct timespec *b);
+void SelHeapUp(SelContext *ctx, uint32_t slot);
+void SelHeapDown(SelContext *ctx, uint32_t slot);
+int SelRunTimers(SelContext *ctx);
 
-QORBU_HIDDEN SelFdEntry *SelFdSlot(SelContext *ctx, int fd);
+SelFdEntry *SelFdSlot(SelContext *ctx, int fd);
 /* The entry of fd when the table reaches it, else null; never grows it. */
 static inline SelFdEntry *SelFdFind(SelContext *ctx, int fd) {
     return fd >= 0 && fd < ctx->fdTableSize ? &ctx->fdTable[fd] : (SelFdEntry *)0;
 }
-QORBU_HIDDEN void SelDispatchFD(SelContext *ctx, int fd, unsigned int event);
+void SelDispatchFD(SelContext *ctx, int fd, unsigned int event);
 
-QORBU_HIDDEN int SelReapIdleFDs(SelTimer *timer);
+int SelReapIdleFDs(SelTimer *timer);
 
-QORBU_HIDDEN void SelDrainHostQueue(void *hostContext);
+void SelDrainHostQueue(void *hostContext);
 
 #ifdef __cplusplus
 }
@@ -87,15 +108,15 @@ inline constexpr int kTimerMisuse = -117;
 inline constexpr int kErestart = 85;
 
 /* The process-wide epoll instance; 0 means select mode. */
-QORBU_HIDDEN extern std::atomic<int> epoll_fd;
+extern std::atomic<int> epoll_fd;
 inline int current_epoll_fd() { return epoll_fd.load(std::memory_order_relaxed); }
 
 /* The reaper timer is armed in one live thread's heap at a time: the
  * owner's. When the owner's thread ends, the next pass of any selector
  * thread takes the reaper over; a pass pays one relaxed load for this. */
-QORBU_HIDDEN extern std::atomic<SelContext *> reaper_owner;
-QORBU_HIDDEN void arm_reaper_if_free(SelContext *ctx);
-QORBU_HIDDEN void release_reaper(SelContext *ctx);
+extern std::atomic<SelContext *> reaper_owner;
+void arm_reaper_if_free(SelContext *ctx);
+void release_reaper(SelContext *ctx);
 inline void adopt_orphaned_reaper(SelContext *ctx) {
     if (reaper_owner.load(std::memory_order_relaxed) == nullptr) arm_reaper_if_free(ctx);
 }
@@ -104,13 +125,13 @@ inline void adopt_orphaned_reaper(SelContext *ctx) {
  * nested pass) and takes an orphaned reaper over. Returns the pass number. */
 inline uint32_t begin_pass(SelContext *ctx) {
     adopt_orphaned_reaper(ctx);
-    return ++ctx->passCount;
+    return ++ctx->pass_count;
 }
 
 /* One SelEpoll pass. The run loop of the green threads passes true: with no
  * timer armed it sleeps until a descriptor or a signal wakes it, where
  * SelEpoll itself does not wait at all. */
-QORBU_HIDDEN int epoll_pass(bool sleepWithoutTimer);
+int epoll_pass(bool sleep_without_timer);
 
 } // namespace qorbu::sel
 #endif

@@ -6,6 +6,7 @@
 #include <cstring>
 
 #include "selector/dispatch_private.h"
+#include "selector/time_private.h"
 
 namespace {
 
@@ -75,7 +76,7 @@ void remove_ours(int nfds, const fd_set *ours) {
  * negative one); so does the wait here, in 64-bit arithmetic that saturates
  * where the sum would overflow. */
 void split_timeout(const struct timeval &tv, long *sec, long *nsec) {
-    constexpr long long kUsecPerSec = 1000000;
+    using qorbu::sel::kUsecPerSec;
     long long usec = tv.tv_usec;
     long long carry = usec / kUsecPerSec;
     usec %= kUsecPerSec;
@@ -147,12 +148,12 @@ extern "C" QORBU_API int zarn_select(int nfds, fd_set *readfds, fd_set *writefds
     clear_if_present(exceptfds);
 
     const int result = SelSelect();
-    const int passErrno = errno;
+    const int pass_errno = errno;
 
     remove_ours(nfds, &ours);
     if (armed) SelRemTimer(&timer);
     if (result < 0) {
-        errno = passErrno;
+        errno = pass_errno;
         return -1;
     }
     return wait.readyCount;

@@ -9,6 +9,7 @@
 #include <cstring>
 
 #include "selector/dispatch_private.h"
+#include "selector/time_private.h"
 
 namespace qorbu::sel {
 
@@ -18,55 +19,26 @@ namespace {
 
 enum class TimeoutSource { None, Timer, Host, Snmp, Zero };
 
+/* What the latest snmp_select_info call gave. */
 struct SnmpInfo {
-    int count;
-    fd_set readSet;
+    int count; /* one past its highest descriptor */
+    fd_set read_set;
     struct timeval timeout;
-    int block;
+    int block; /* 0: timeout holds the time until its next time-out */
 };
 
-/* Everything one pass computes. */
-struct Pass {
-    SelContext *ctx;
-    SelHostScheduler *host; /* null: host hooks off for this pass */
-    int width;              /* first argument of select/pselect */
-    SnmpInfo snmp;
-    struct timespec now;
-    TimeoutSource chosen;
-    struct timespec timeout;
-    int waitResult;
-    int ready; /* reported (descriptor, kind) pairs not dispatched yet */
-    bool scanDispatched;
-    uint32_t number; /* the context's passCount when this pass began */
-};
-
-constexpr const char *kWaitFailed = "SelSelect(): [p]select() failed";
-
-SelHostScheduler *host_scheduler_of(void *zg) {
-    if (!zg || !host_functions_present()) return nullptr;
-    return static_cast<SelHostContext *>(zg)->scheduler;
-}
-
-void copy_interest_sets(Pass &p) {
-    SelContext *ctx = p.ctx;
-    ctx->readyRead = ctx->readSet;
-    ctx->readyWrite = ctx->writeSet;
-    ctx->readyExcept = ctx->exceptSet;
-    p.width = ctx->nfds;
-}
+/* --- merging the host's and Net-SNMP's descriptors ------------------------- */
 
 /* The wait never reaches past the working sets, whatever count the host or
  * Net-SNMP report: descriptors of theirs at 1024 or above are not waited on. */
-void raise_width(Pass &p, int width) {
-    width = clamp_to_set_size(width);
-    if (width > p.width) p.width = width;
+int raised_width(int width, int count) {
+    count = clamp_to_set_size(count);
+    return count > width ? count : width;
 }
 
-/* Adds the host's descriptors 0..max_fd to the working sets and widens the
- * wait to the highest of them. */
-void merge_host_sets(Pass &p) {
-    const SelHostScheduler *host = p.host;
-    SelContext *ctx = p.ctx;
+/* Adds the host's descriptors 0..max_fd to the working sets; returns the
+ * wait width raised to one past the highest of them. */
+int merge_host_sets(SelContext *ctx, const SelHostScheduler *host, int width) {
     const int limit = host->max_fd >= kSelectSetSize ? kSelectSetSize : clamp_to_set_size(host->max_fd + 1);
     for (int i = 0; i * kFdWordBits < limit; ++i) {
         const FdWord mask = fd_word_mask_below(i, limit);
@@ -76,199 +48,59 @@ void merge_host_sets(Pass &p) {
         or_fd_word(&ctx->readyRead, i, r);
         or_fd_word(&ctx->readyWrite, i, w);
         or_fd_word(&ctx->readyExcept, i, e);
-        if (r | w | e) raise_width(p, i * kFdWordBits + highest_bit(r | w | e) + 1);
+        if (r | w | e) width = raised_width(width, i * kFdWordBits + highest_bit(r | w | e) + 1);
     }
+    return width;
 }
 
-void query_snmp(Pass &p) {
-    p.snmp.count = 0;
-    FD_ZERO(&p.snmp.readSet);
-    p.snmp.timeout = {0, 0};
-    p.snmp.block = 1;
-    if (snmp_present()) snmp_select_info(&p.snmp.count, &p.snmp.readSet, &p.snmp.timeout, &p.snmp.block);
-}
-
-void merge_snmp_reads(Pass &p) {
-    const int limit = clamp_to_set_size(p.snmp.count);
+/* Asks Net-SNMP for its descriptors and its time-out, adds its descriptors
+ * to the working read set and returns the wait width raised to its count. */
+int ask_snmp(SelContext *ctx, SnmpInfo *snmp, int width) {
+    snmp->count = 0;
+    FD_ZERO(&snmp->read_set);
+    snmp->timeout = {0, 0};
+    snmp->block = 1;
+    if (snmp_present()) snmp_select_info(&snmp->count, &snmp->read_set, &snmp->timeout, &snmp->block);
+    const int limit = clamp_to_set_size(snmp->count);
     for (int i = 0; i * kFdWordBits < limit; ++i)
-        or_fd_word(&p.ctx->readyRead, i, fd_word(&p.snmp.readSet, i) & fd_word_mask_below(i, limit));
+        or_fd_word(&ctx->readyRead, i, fd_word(&snmp->read_set, i) & fd_word_mask_below(i, limit));
+    return raised_width(width, snmp->count);
 }
 
-/* --- the time-out ---------------------------------------------------------- */
-
-struct timespec difference(const struct timespec &later, const struct timespec &earlier) {
-    struct timespec d = {later.tv_sec - earlier.tv_sec, later.tv_nsec - earlier.tv_nsec};
-    if (d.tv_nsec < 0) {
-        d.tv_sec -= 1;
-        d.tv_nsec += kNsecPerSec;
-    }
-    return d;
+/* One of Net-SNMP's descriptors was reported readable. */
+bool snmp_descriptor_reported(const SelContext *ctx, const SnmpInfo &snmp) {
+    const int limit = clamp_to_set_size(snmp.count);
+    for (int i = 0; i * kFdWordBits < limit; ++i)
+        if (fd_word(&ctx->readyRead, i) & fd_word(&snmp.read_set, i) & fd_word_mask_below(i, limit))
+            return true;
+    return false;
 }
 
-struct timespec to_timespec(const struct timeval &tv) {
-    struct timespec ts;
-    ts.tv_sec = tv.tv_sec;
-    ts.tv_nsec = static_cast<long>(static_cast<long long>(tv.tv_usec) * kNsecPerUsec);
-    return ts;
-}
-
-/* Candidates are offered in the order timer, host, SNMP: an equal later
- * candidate does not replace an earlier one. */
-void offer_timeout(Pass &p, TimeoutSource source, const struct timespec &candidate) {
-    if (p.chosen == TimeoutSource::None || SelTimerBefore(&candidate, &p.timeout)) {
-        p.chosen = source;
-        p.timeout = candidate;
-    }
-}
-
-void choose_timer_timeout(Pass &p) {
-    const SelContext *ctx = p.ctx;
-    if (ctx->timerCount <= 0 || !ctx->timerHeap[1]) return;
-    p.chosen = TimeoutSource::Timer;
-    p.timeout = difference(ctx->timerHeap[1]->when, p.now);
-}
-
-bool earliest_host_due_time(const SelHostScheduler *host, struct timeval *earliest) {
+/* The host's time-out: None when none of its timed lists holds a task, Zero
+ * (and a zero timeout) when the earliest task is due by the host's clock,
+ * else Host with the time until it is. The lists keep their earliest task
+ * first; on equal due times the earlier list's task counts. */
+TimeoutSource host_timeout(const SelHostScheduler *host, struct timespec *timeout) {
+    struct timeval due;
     bool found = false;
     for (int i = 0; i < kHostTimedLists; ++i) {
         const SelHostTask *first = host->timed[i];
         if (!first) continue;
-        if (!found || timeval_cmp(*earliest, first->when) > 0) *earliest = first->when;
+        if (!found || timeval_cmp(due, first->when) > 0) due = first->when;
         found = true;
     }
-    return found;
-}
-
-void choose_host_timeout(Pass &p) {
-    struct timeval due;
-    if (!earliest_host_due_time(p.host, &due)) return;
-    struct timeval hostNow = {0, 0};
-    pal_time_tzcurrent(&hostNow, nullptr);
-    if (timeval_cmp(hostNow, due) >= 0) {
-        p.chosen = TimeoutSource::Zero;
-        p.timeout = {0, 0};
-        return;
+    if (!found) return TimeoutSource::None;
+    struct timeval host_now = {0, 0};
+    pal_time_tzcurrent(&host_now, nullptr);
+    if (timeval_cmp(host_now, due) >= 0) {
+        *timeout = {0, 0};
+        return TimeoutSource::Zero;
     }
-    offer_timeout(p, TimeoutSource::Host, to_timespec(timeval_sub(due, hostNow)));
+    *timeout = timeval_to_timespec(timeval_sub(due, host_now));
+    return TimeoutSource::Host;
 }
 
-void choose_snmp_timeout(Pass &p) {
-    query_snmp(p);
-    if (p.snmp.block == 0) offer_timeout(p, TimeoutSource::Snmp, to_timespec(p.snmp.timeout));
-}
-
-void clear_negative_timeout(Pass &p) {
-    if (p.chosen == TimeoutSource::None) return;
-    if (p.timeout.tv_sec >= 0 && p.timeout.tv_nsec >= 0) return;
-    fprintf(stderr, "tmeval in pselect -ve %d:%d\n", static_cast<int>(p.timeout.tv_sec),
-            static_cast<int>(p.timeout.tv_nsec));
-    p.timeout = {0, 0};
-}
-
-/* --- waiting --------------------------------------------------------------- */
-
-/* The thread's mask with the registered signals taken out. Read only when
- * the pass is about to block: the poll runs with the mask as it is. */
-void build_wait_mask(const SelContext *ctx, sigset_t *mask) {
-    sigset_t none;
-    sigemptyset(&none);
-    sigprocmask(SIG_BLOCK, &none, mask);
-    for (int signo = 1; signo <= kMaxSignal; ++signo)
-        if (sigismember(&ctx->signals, signo) == 1) sigdelset(mask, signo);
-}
-
-int poll_working_sets(Pass &p) {
-    struct timeval zero = {0, 0};
-    SelContext *ctx = p.ctx;
-    p.waitResult = select(p.width, &ctx->readyRead, &ctx->readyWrite, &ctx->readyExcept, &zero);
-    return p.waitResult;
-}
-
-int wait_working_sets(Pass &p) {
-    sigset_t mask;
-    build_wait_mask(p.ctx, &mask);
-    SelContext *ctx = p.ctx;
-    const struct timespec *timeout = p.chosen == TimeoutSource::None ? nullptr : &p.timeout;
-    p.waitResult = pselect(p.width, &ctx->readyRead, &ctx->readyWrite, &ctx->readyExcept, timeout, &mask);
-    return p.waitResult;
-}
-
-/* --- diagnostics ----------------------------------------------------------- */
-
-unsigned long printed_word(const fd_set *set, int i) {
-    const int bit = i * kPrintedWordBits;
-    return (fd_word(set, bit / kFdWordBits) >> (bit % kFdWordBits)) & 0xffffffffUL;
-}
-
-void print_einval_diagnostic(const Pass &p) {
-    const SelContext *ctx = p.ctx;
-    fprintf(stderr, "invalid params in select %d tl fd %d snmp fd %d fdsetsize %d ", p.width, ctx->nfds,
-            p.snmp.count, kSelectSetSize);
-    fprintf(stderr, "timeval %d:%d \n", static_cast<int>(p.timeout.tv_sec), static_cast<int>(p.timeout.tv_nsec));
-    for (int i = 0; i < kSelectSetSize / kPrintedWordBits; ++i) {
-        fprintf(stderr, "selreadset %d %lx\t", i, printed_word(&ctx->readyRead, i));
-        fprintf(stderr, "selwriteset %lx\t", printed_word(&ctx->readyWrite, i));
-        fprintf(stderr, "seloobset %lx\n", printed_word(&ctx->readyExcept, i));
-        fprintf(stderr, "readset %d %lx\t", i, printed_word(&ctx->readSet, i));
-        fprintf(stderr, "writeset %lx\t", printed_word(&ctx->writeSet, i));
-        fprintf(stderr, "oobset %lx\n", printed_word(&ctx->exceptSet, i));
-    }
-}
-
-void add_set(fd_set *to, const fd_set *from) {
-    for (int i = 0; i < kFdWords; ++i) or_fd_word(to, i, fd_word(from, i));
-}
-
-bool probe_is_bad(int fd) {
-    fd_set one;
-    FD_ZERO(&one);
-    FD_SET(fd, &one);
-    struct timeval zero = {0, 0};
-    return select(fd + 1, &one, nullptr, nullptr, &zero) < 0 && errno == EBADF;
-}
-
-void *callback_of(const SelContext *ctx, int fd) {
-    if (fd >= ctx->nfds || fd >= ctx->fdTableSize) return nullptr;
-    return reinterpret_cast<void *>(ctx->fdTable[fd].callback);
-}
-
-/* Names every watched descriptor that the kernel refuses. */
-void print_ebadf_diagnostic(Pass &p) {
-    const SelContext *ctx = p.ctx;
-    fd_set watched;
-    FD_ZERO(&watched);
-    if (snmp_present()) snmp_select_info(&p.snmp.count, &watched, &p.snmp.timeout, &p.snmp.block);
-    add_set(&watched, &ctx->readSet);
-    add_set(&watched, &ctx->writeSet);
-    add_set(&watched, &ctx->exceptSet);
-    if (p.host) {
-        add_set(&watched, &p.host->readfd);
-        add_set(&watched, &p.host->writefd);
-        add_set(&watched, &p.host->exceptfd);
-    }
-    const int limit = clamp_to_set_size(p.width);
-    for (int fd = 0; fd < limit; ++fd)
-        if (FD_ISSET(fd, &watched) && probe_is_bad(fd))
-            fprintf(stderr, "SelSelect(): fd %d (callback %p) is invalid (probably close()ed)\n", fd,
-                    callback_of(ctx, fd));
-}
-
-int handle_wait_failure(Pass &p) {
-    const int error = errno;
-    if (error == EINTR || error == kErestart) return -1;
-    perror(kWaitFailed);
-    if (error == EINVAL) {
-        const int failures = sel_einval_count.fetch_add(1, std::memory_order_relaxed) + 1;
-        print_einval_diagnostic(p);
-        if (failures > kEinvalFailuresTolerated) abort();
-        errno = EINVAL;
-        return -1;
-    }
-    if (error == EBADF) print_ebadf_diagnostic(p);
-    abort();
-}
-
-/* --- dispatch -------------------------------------------------------------- */
+/* --- dispatching the ready sets -------------------------------------------- */
 
 /* Lowest descriptor in [from, to) whose reported readiness is still
  * registered, or -1. Working and interest sets are read afresh on every
@@ -298,113 +130,122 @@ bool any_exceptional_reported(const SelContext *ctx) {
     return false;
 }
 
-/* Runs one callback. True when this pass has nothing more to dispatch:
- * the ready count is spent, or the callback ran a nested pass, which reused
- * the working sets and served what this pass had left. */
-bool dispatch_one(Pass &p, int fd, unsigned int event) {
-    SelDispatchFD(p.ctx, fd, event);
-    if (p.ctx->passCount != p.number) {
-        p.ready = 0;
-        return true;
-    }
-    return --p.ready == 0;
-}
-
-bool dispatch_exceptional(Pass &p, int limit) {
-    SelContext *ctx = p.ctx;
-    for (int fd = next_exceptional(ctx, 0, limit); fd >= 0; fd = next_exceptional(ctx, fd + 1, limit))
-        if (dispatch_one(p, fd, SEL_EXCEPT)) return true;
-    return false;
-}
-
-bool dispatch_read_write(Pass &p, int fd, unsigned int event) {
-    const bool first = !p.scanDispatched;
-    p.scanDispatched = true;
-    const bool done = dispatch_one(p, fd, event);
-    if (first) p.ctx->scanStart = fd + 1;
-    return done;
-}
-
-bool dispatch_read_write_range(Pass &p, int from, int to) {
-    SelContext *ctx = p.ctx;
-    for (int fd = next_read_write(ctx, from, to); fd >= 0; fd = next_read_write(ctx, fd + 1, to)) {
-        if (FD_ISSET(fd, &ctx->readyRead) && FD_ISSET(fd, &ctx->readSet) && dispatch_read_write(p, fd, SEL_READ))
-            return true;
-        if (FD_ISSET(fd, &ctx->readyWrite) && FD_ISSET(fd, &ctx->writeSet) && dispatch_read_write(p, fd, SEL_WRITE))
-            return true;
-    }
-    return false;
-}
-
-/* Exceptional conditions first, then reading and writing round robin from
- * one past the first descriptor served by the previous scan. */
-void dispatch_ready(Pass &p) {
-    SelContext *ctx = p.ctx;
+/* Calls back the descriptors the wait reported: exceptional conditions
+ * first, in descriptor order; then reading and writing, round robin from
+ * one past the first descriptor served by the previous scan. Stops as soon
+ * as the ready count is spent, or once a callback has run a nested pass
+ * (which reused the working sets and served what this pass had left).
+ * Returns the ready pairs left over: those of the host and of Net-SNMP,
+ * and those of descriptors removed meanwhile. */
+int dispatch_ready(SelContext *ctx, int ready, uint32_t pass) {
     const int limit = clamp_to_set_size(ctx->nfds);
-    if (any_exceptional_reported(ctx) && dispatch_exceptional(p, limit)) return;
+    auto spent = [&] { return ctx->pass_count != pass || --ready == 0; };
+
+    if (any_exceptional_reported(ctx)) {
+        for (int fd = next_exceptional(ctx, 0, limit); fd >= 0; fd = next_exceptional(ctx, fd + 1, limit)) {
+            SelDispatchFD(ctx, fd, SEL_EXCEPT);
+            if (spent()) return 0;
+        }
+    }
+
+    bool first = true;
+    auto dispatch_read_write = [&](int fd, unsigned int event) {
+        SelDispatchFD(ctx, fd, event);
+        if (first) ctx->scanStart = fd + 1;
+        first = false;
+        return spent();
+    };
+    /* One stretch of the round: true once nothing more is to be dispatched. */
+    auto scan = [&](int from, int to) {
+        for (int fd = next_read_write(ctx, from, to); fd >= 0; fd = next_read_write(ctx, fd + 1, to)) {
+            if (FD_ISSET(fd, &ctx->readyRead) && FD_ISSET(fd, &ctx->readSet) &&
+                dispatch_read_write(fd, SEL_READ))
+                return true;
+            if (FD_ISSET(fd, &ctx->readyWrite) && FD_ISSET(fd, &ctx->writeSet) &&
+                dispatch_read_write(fd, SEL_WRITE))
+                return true;
+        }
+        return false;
+    };
     const int start = clamp_to_set_size(ctx->scanStart);
-    p.scanDispatched = false;
-    if (dispatch_read_write_range(p, start, limit)) return;
-    if (dispatch_read_write_range(p, 0, start)) return;
+    if (scan(start, limit) || scan(0, start)) return 0;
     sel_einval_count.store(0, std::memory_order_relaxed);
+    return ready;
 }
 
-/* --- end of pass ----------------------------------------------------------- */
+/* --- a failed wait --------------------------------------------------------- */
 
-bool snmp_descriptor_reported(const Pass &p) {
-    const int limit = clamp_to_set_size(p.snmp.count);
-    for (int i = 0; i * kFdWordBits < limit; ++i)
-        if (fd_word(&p.ctx->readyRead, i) & fd_word(&p.snmp.readSet, i) & fd_word_mask_below(i, limit))
-            return true;
-    return false;
+constexpr const char *kWaitFailed = "SelSelect(): [p]select() failed";
+
+unsigned long printed_word(const fd_set *set, int i) {
+    const int bit = i * kPrintedWordBits;
+    return (fd_word(set, bit / kFdWordBits) >> (bit % kFdWordBits)) & 0xffffffffUL;
 }
 
-void service_snmp_timeout() {
-    if (snmp_timeout) snmp_timeout();
-    if (run_alarms) run_alarms();
-}
-
-int finish_pass(Pass &p) {
-    SelContext *ctx = p.ctx;
-    SelRunTimers(ctx);
-    if (p.host) {
-        thread_select_nb(ctx->zg);
-        SelDrainHostQueue(ctx->zg);
+void print_einval_diagnostic(const SelContext *ctx, int width, const SnmpInfo &snmp,
+                             const struct timespec &timeout) {
+    fprintf(stderr, "invalid params in select %d tl fd %d snmp fd %d fdsetsize %d ", width, ctx->nfds,
+            snmp.count, kSelectSetSize);
+    fprintf(stderr, "timeval %d:%d \n", static_cast<int>(timeout.tv_sec), static_cast<int>(timeout.tv_nsec));
+    for (int i = 0; i < kSelectSetSize / kPrintedWordBits; ++i) {
+        fprintf(stderr, "selreadset %d %lx\t", i, printed_word(&ctx->readyRead, i));
+        fprintf(stderr, "selwriteset %lx\t", printed_word(&ctx->readyWrite, i));
+        fprintf(stderr, "seloobset %lx\n", printed_word(&ctx->readyExcept, i));
+        fprintf(stderr, "readset %d %lx\t", i, printed_word(&ctx->readSet, i));
+        fprintf(stderr, "writeset %lx\t", printed_word(&ctx->writeSet, i));
+        fprintf(stderr, "oobset %lx\n", printed_word(&ctx->exceptSet, i));
     }
-    if (p.waitResult == 0 && p.chosen == TimeoutSource::Snmp) service_snmp_timeout();
-    if (p.waitResult > 0 && p.ready > 0 && snmp_read && snmp_descriptor_reported(p)) snmp_read(&ctx->readyRead);
-    return 0;
 }
 
-int dispatch_and_finish(Pass &p) {
-    p.ready = p.waitResult;
-    dispatch_ready(p);
-    return finish_pass(p);
+void add_set(fd_set *to, const fd_set *from) {
+    for (int i = 0; i < kFdWords; ++i) or_fd_word(to, i, fd_word(from, i));
 }
 
-/* Steps up to the poll: working sets, host queue and sets, SNMP reads. */
-void prepare_poll(Pass &p) {
-    copy_interest_sets(p);
-    if (p.host) {
-        SelDrainHostQueue(p.ctx->zg);
-        merge_host_sets(p);
+/* Names every watched descriptor below the wait width that the kernel
+ * refuses when probed alone. */
+void print_ebadf_diagnostic(const SelContext *ctx, const SelHostScheduler *host, int width, SnmpInfo &snmp) {
+    fd_set watched;
+    FD_ZERO(&watched);
+    if (snmp_present()) snmp_select_info(&snmp.count, &watched, &snmp.timeout, &snmp.block);
+    add_set(&watched, &ctx->readSet);
+    add_set(&watched, &ctx->writeSet);
+    add_set(&watched, &ctx->exceptSet);
+    if (host) {
+        add_set(&watched, &host->readfd);
+        add_set(&watched, &host->writefd);
+        add_set(&watched, &host->exceptfd);
     }
-    query_snmp(p);
-    merge_snmp_reads(p);
-    raise_width(p, p.snmp.count);
+    const int limit = clamp_to_set_size(width);
+    for (int fd = 0; fd < limit; ++fd) {
+        if (!FD_ISSET(fd, &watched)) continue;
+        fd_set one;
+        FD_ZERO(&one);
+        FD_SET(fd, &one);
+        struct timeval zero = {0, 0};
+        if (select(fd + 1, &one, nullptr, nullptr, &zero) >= 0 || errno != EBADF) continue;
+        const bool ours = fd < ctx->nfds && fd < ctx->fdTableSize;
+        fprintf(stderr, "SelSelect(): fd %d (callback %p) is invalid (probably close()ed)\n", fd,
+                ours ? reinterpret_cast<void *>(ctx->fdTable[fd].callback) : nullptr);
+    }
 }
 
-/* Steps before the blocking wait: host queue, fresh sets, the time-out. */
-void prepare_wait(Pass &p) {
-    if (p.host) SelDrainHostQueue(p.ctx->zg);
-    copy_interest_sets(p);
-    if (p.host) merge_host_sets(p);
-    choose_timer_timeout(p);
-    if (p.host) choose_host_timeout(p);
-    choose_snmp_timeout(p);
-    merge_snmp_reads(p);
-    raise_width(p, p.snmp.count);
-    clear_negative_timeout(p);
+/* An interruption returns -1 with errno kept; the first four EINVAL
+ * failures (counted process-wide) return -1 after their diagnostic;
+ * anything else ends the process. */
+int handle_wait_failure(const SelContext *ctx, const SelHostScheduler *host, int width, SnmpInfo &snmp,
+                        const struct timespec &timeout) {
+    const int error = errno;
+    if (error == EINTR || error == kErestart) return -1;
+    perror(kWaitFailed);
+    if (error == EINVAL) {
+        const int failures = sel_einval_count.fetch_add(1, std::memory_order_relaxed) + 1;
+        print_einval_diagnostic(ctx, width, snmp, timeout);
+        if (failures > kEinvalFailuresTolerated) abort();
+        errno = EINVAL;
+        return -1;
+    }
+    if (error == EBADF) print_ebadf_diagnostic(ctx, host, width, snmp);
+    abort();
 }
 
 } // namespace
@@ -413,23 +254,107 @@ void prepare_wait(Pass &p) {
 using namespace qorbu::sel;
 
 extern "C" QORBU_API int SelSelect(void) {
-    Pass p{};
-    p.ctx = SelCurrentContext();
-    p.number = begin_pass(p.ctx);
-    p.host = host_scheduler_of(p.ctx->zg);
-    p.chosen = TimeoutSource::None;
+    /* 1. The thread's context; the pass is counted, so that a nested pass run
+     *    by a callback ends the dispatch below. The host hooks are on or off
+     *    for the whole pass. */
+    SelContext *ctx = SelCurrentContext();
+    const uint32_t pass = begin_pass(ctx);
+    SelHostScheduler *host =
+        ctx->zg && host_functions_present() ? static_cast<SelHostContext *>(ctx->zg)->scheduler : nullptr;
+    SnmpInfo snmp;
+    TimeoutSource chosen = TimeoutSource::None;
+    struct timespec timeout = {0, 0};
 
-    prepare_poll(p);
-    const int polled = poll_working_sets(p);
-    if (polled > 0) return dispatch_and_finish(p);
-    if (polled < 0) return handle_wait_failure(p);
+    /* 2. The working sets start as copies of the interest sets. */
+    ctx->readyRead = ctx->readSet;
+    ctx->readyWrite = ctx->writeSet;
+    ctx->readyExcept = ctx->exceptSet;
+    int width = ctx->nfds;
 
-    SelGetTime(&p.now);
-    if (SelRunTimers(p.ctx) > 0) return 0;
+    /* 3. Run the host's queued tasks and add its descriptors. */
+    if (host) {
+        SelDrainHostQueue(ctx->zg);
+        width = merge_host_sets(ctx, host, width);
+    }
 
-    prepare_wait(p);
-    const int waited = wait_working_sets(p);
-    if (waited > 0) return dispatch_and_finish(p);
-    if (waited < 0) return handle_wait_failure(p);
-    return finish_pass(p);
+    /* 4. Add Net-SNMP's descriptors. */
+    width = ask_snmp(ctx, &snmp, width);
+
+    /* 5. Poll: whatever is ready is dispatched at once, without a time-out
+     *    and with the signal mask as it is. */
+    struct timeval zero = {0, 0};
+    int ready = select(width, &ctx->readyRead, &ctx->readyWrite, &ctx->readyExcept, &zero);
+
+    if (ready == 0) {
+        /* 6. Nothing ready: fire the due timers; a pass that fired any ends here. */
+        struct timespec now;
+        SelGetTime(&now);
+        if (SelRunTimers(ctx) > 0) return 0;
+
+        /* 7. Run the host's queue again and take fresh working sets. */
+        if (host) SelDrainHostQueue(ctx->zg);
+        ctx->readyRead = ctx->readSet;
+        ctx->readyWrite = ctx->writeSet;
+        ctx->readyExcept = ctx->exceptSet;
+        width = ctx->nfds;
+        if (host) width = merge_host_sets(ctx, host, width);
+
+        /* 8. The time-out: the earliest of the timer's, the host's and
+         *    Net-SNMP's; on a tie the earlier of these sources stays chosen,
+         *    and a host task already due gives a zero time-out. */
+        auto offer = [&](TimeoutSource source, const struct timespec &candidate) {
+            if (source == TimeoutSource::Zero || chosen == TimeoutSource::None ||
+                SelTimerBefore(&candidate, &timeout)) {
+                chosen = source;
+                timeout = candidate;
+            }
+        };
+        if (ctx->timerCount > 0 && ctx->timerHeap[1])
+            offer(TimeoutSource::Timer, timespec_sub(ctx->timerHeap[1]->when, now));
+        struct timespec candidate = {0, 0};
+        if (host) {
+            const TimeoutSource source = host_timeout(host, &candidate);
+            if (source != TimeoutSource::None) offer(source, candidate);
+        }
+        width = ask_snmp(ctx, &snmp, width);
+        if (snmp.block == 0) offer(TimeoutSource::Snmp, timeval_to_timespec(snmp.timeout));
+
+        /* 9. A negative time-out is reported and waits for nothing. */
+        if (chosen != TimeoutSource::None && (timeout.tv_sec < 0 || timeout.tv_nsec < 0)) {
+            fprintf(stderr, "tmeval in pselect -ve %d:%d\n", static_cast<int>(timeout.tv_sec),
+                    static_cast<int>(timeout.tv_nsec));
+            timeout = {0, 0};
+        }
+
+        /* 10. Wait, with the thread's mask as it is now minus the registered
+         *     signals; without a time-out until a descriptor or a signal. */
+        sigset_t mask, none;
+        sigemptyset(&none);
+        sigprocmask(SIG_BLOCK, &none, &mask);
+        for (int signo = 1; signo <= kMaxSignal; ++signo)
+            if (sigismember(&ctx->signals, signo) == 1) sigdelset(&mask, signo);
+        ready = pselect(width, &ctx->readyRead, &ctx->readyWrite, &ctx->readyExcept,
+                        chosen == TimeoutSource::None ? nullptr : &timeout, &mask);
+    }
+    if (ready < 0) return handle_wait_failure(ctx, host, width, snmp, timeout);
+
+    /* 11. Dispatch what the poll or the wait reported. */
+    const int reported = ready;
+    if (reported > 0) ready = dispatch_ready(ctx, reported, pass);
+
+    /* 12. End of pass: due timers, the host's servicing and its queue, then
+     *     Net-SNMP's time-out when the wait ended on it, or its reading when
+     *     one of its descriptors was reported. */
+    SelRunTimers(ctx);
+    if (host) {
+        thread_select_nb(ctx->zg);
+        SelDrainHostQueue(ctx->zg);
+    }
+    if (reported == 0 && chosen == TimeoutSource::Snmp) {
+        if (snmp_timeout) snmp_timeout();
+        if (run_alarms) run_alarms();
+    }
+    if (reported > 0 && ready > 0 && snmp_read && snmp_descriptor_reported(ctx, snmp))
+        snmp_read(&ctx->readyRead);
+    return 0;
 }

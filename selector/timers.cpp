@@ -1,24 +1,22 @@
 // Monotonic timers kept in a per-thread binary min-heap of caller-owned
 // records. Slot 0 of the heap array is not part of the heap: the expiry run
 // parks the timer it is firing there.
-#include <errno.h>
-#include <signal.h>
-#include <stdint.h>
-#include <stdio.h>
-#include <stdlib.h>
+#include <cerrno>
+#include <csignal>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
 #include <unistd.h>
 
 #include <limits>
 
 #include "selector/sel_private.h"
+#include "selector/time_private.h"
 
 using namespace qorbu::sel;
 
 namespace {
 
-constexpr long kNsecPerSec = 1000000000L;
-constexpr unsigned kMsecPerSec = 1000u;
-constexpr long kNsecPerMsec = 1000000L;
 // Doubling must keep both the slot count and the byte size representable.
 constexpr int32_t kMaxTimerCapacity = static_cast<int32_t>(
     (SIZE_MAX / sizeof(SelTimer *) - 1) / 2 < INT32_MAX / 2 ? (SIZE_MAX / sizeof(SelTimer *) - 1) / 2
@@ -236,8 +234,9 @@ int SelDebugIsTimerActive(SelTimer *t) {
 }
 
 int SelSleep(SelTimer *t, unsigned int ms) {
+    const struct timespec span = ms_to_timespec(ms);
     struct timespec when;
-    SelMakeWhen(&when, static_cast<long>(ms / kMsecPerSec), static_cast<long>(ms % kMsecPerSec) * kNsecPerMsec);
+    SelMakeWhen(&when, static_cast<long>(span.tv_sec), span.tv_nsec);
     return SelModifyTimer(t, &when);
 }
 

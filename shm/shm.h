@@ -39,9 +39,7 @@
 #include <stdint.h>
 #include <stdio.h>
 
-#ifndef QORBU_API
-#define QORBU_API __attribute__((visibility("default")))
-#endif
+#include "qorbu_api.h"
 
 #ifdef __cplusplus
 extern "C" {

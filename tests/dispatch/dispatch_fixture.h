@@ -6,9 +6,9 @@
 #ifndef QORBU_TESTS_DISPATCH_FIXTURE_H
 #define QORBU_TESTS_DISPATCH_FIXTURE_H
 
+#include <csignal>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <signal.h>
 #include <sys/socket.h>
 #include <unistd.h>
 

@@ -1,9 +1,9 @@
 // nb_accept, nb_connect, nb_read, nb_readall and nb_write: retries on
 // EAGAIN, end of file, short reads, large writes, refused connections,
 // interrupted calls and descriptors the selector refuses.
+#include <csignal>
+#include <cstdlib>
 #include <poll.h>
-#include <signal.h>
-#include <stdlib.h>
 #include <sys/time.h>
 
 #include <algorithm>

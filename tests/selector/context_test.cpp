@@ -1,7 +1,7 @@
-#include <errno.h>
+#include <cerrno>
+#include <csignal>
+#include <cstddef>
 #include <pthread.h>
-#include <signal.h>
-#include <stddef.h>
 
 #include <atomic>
 #include <thread>
@@ -10,27 +10,6 @@
 #include "selector_fixture.h"
 
 using qorbu::test::SelectorTest;
-
-#if UINTPTR_MAX == 0xffffffffu
-// Debuggers and host tools read these records on the 32-bit targets.
-static_assert(sizeof(time_t) == 4 && sizeof(long) == 4);
-static_assert(offsetof(SelTimer, heapIndex) == 0 && offsetof(SelTimer, when) == 4);
-static_assert(offsetof(SelTimer, callback) == 12 && offsetof(SelTimer, arg) == 16 && sizeof(SelTimer) == 20);
-static_assert(offsetof(SelFdEntry, events) == 0 && offsetof(SelFdEntry, idleTracked) == 4);
-static_assert(offsetof(SelFdEntry, lastActivity) == 8 && offsetof(SelFdEntry, callback) == 16);
-static_assert(offsetof(SelFdEntry, arg) == 20 && sizeof(SelFdEntry) == 24);
-static_assert(offsetof(SelContext, signals) == 0 && offsetof(SelContext, readSet) == 128);
-static_assert(offsetof(SelContext, writeSet) == 256 && offsetof(SelContext, exceptSet) == 384);
-static_assert(offsetof(SelContext, nfds) == 512 && offsetof(SelContext, scanStart) == 516);
-static_assert(offsetof(SelContext, fdTable) == 520 && offsetof(SelContext, fdTableSize) == 524);
-static_assert(offsetof(SelContext, timerHeap) == 528 && offsetof(SelContext, timerCount) == 532);
-static_assert(offsetof(SelContext, timerCapacity) == 536 && offsetof(SelContext, zg) == 540);
-static_assert(offsetof(SelContext, readyRead) == 544 && offsetof(SelContext, readyWrite) == 672);
-static_assert(offsetof(SelContext, readyExcept) == 800);
-// Later fields are appended behind the ones above, which keep their places.
-static_assert(offsetof(SelContext, passCount) == 928);
-#endif
-static_assert(SEL_READ == 1u && SEL_WRITE == 2u && SEL_EXCEPT == 4u && SEL_IN_CALLBACK == 8u);
 
 namespace {
 

@@ -1,4 +1,4 @@
-#include <errno.h>
+#include <cerrno>
 #include <fcntl.h>
 #include <sys/time.h>
 #include <unistd.h>

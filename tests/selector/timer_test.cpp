@@ -1,6 +1,6 @@
-#include <errno.h>
-#include <signal.h>
-#include <stdlib.h>
+#include <cerrno>
+#include <csignal>
+#include <cstdlib>
 
 #include <algorithm>
 #include <climits>
