@@ -83,7 +83,7 @@ void run_one_turn();
 inline bool in_main_context() { return current_thread == main_thread; }
 
 /* Stacks (stack.cpp). */
-size_t stack_mapping_length(long pageSize);
+size_t stack_mapping_length(long page_bytes);
 bool process_wants_executable_stack();
 /* Maps a stack of stack_mapping_length() bytes whose lowest page is the
  * guard page; null (errno set) when the mapping fails. */

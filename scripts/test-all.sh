@@ -1,6 +1,6 @@
 #!/usr/bin/env bash
 # The whole test suite on a fresh Debian 12 machine: installs what it needs,
-# then builds and runs ctest for x86_64, i386 (qemu), armhf (qemu) and the
+# checks that every C and C++ file is formatted as .clang-format says, then builds and runs ctest for x86_64, i386 (qemu), armhf (qemu) and the
 # address/undefined-behaviour sanitizers, and fuzzes the allocator briefly
 # (preset fuzz: clang, the fuzzer run for 30 s as its ctest).
 set -uo pipefail
@@ -9,10 +9,18 @@ source scripts/require-packages.sh
 
 require_packages cmake ninja-build g++ gcc googletest valgrind pkg-config \
     g++-arm-linux-gnueabihf g++-i686-linux-gnu qemu-user \
-    libsnmp-dev snmp clang libclang-rt-14-dev dpkg-dev file || exit 1
+    libsnmp-dev snmp clang clang-format libclang-rt-14-dev dpkg-dev file || exit 1
 
 jobs=$(nproc)
 failed=()
+
+echo "=== style ==="
+if git ls-files -z '*.c' '*.h' '*.cpp' | xargs -0 clang-format --dry-run --Werror; then
+    echo "=== style: passed ==="
+else
+    failed+=(style)
+fi
+
 for preset in default i386 armhf asan fuzz; do
     echo "=== $preset ==="
     if cmake --preset "$preset" >/dev/null &&
