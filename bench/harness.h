@@ -37,32 +37,42 @@ inline double now_ns() { return clock_ns(sample_clock()); }
 inline double wall_ns() { return clock_ns(CLOCK_MONOTONIC); }
 
 // Keeps the compiler from dropping work whose result is otherwise unused.
-template <class T> inline void keep(T const &value) { asm volatile("" : : "r,m"(value) : "memory"); }
+template <class T>
+inline void keep(T const &value) {
+    asm volatile("" : : "r,m"(value) : "memory");
+}
 
 // Command-line knobs shared by every driver.
 struct Options {
-    int reps = 7;                 // repetitions per figure (median of these)
-    double sample_ms = 20;        // target duration of one timed sample
-    double scale = 1.0;           // <1 for a quick smoke run
-    std::string out_dir = ".";    // where fragments, data and plot scripts go
-    std::string only;             // run only contenders whose name contains this (profiling)
+    int reps = 7;              // repetitions per figure (median of these)
+    double sample_ms = 20;     // target duration of one timed sample
+    double scale = 1.0;        // <1 for a quick smoke run
+    std::string out_dir = "."; // where fragments, data and plot scripts go
+    std::string only;          // run only contenders whose name contains this (profiling)
 
     static Options parse(int argc, char **argv) {
-        static const option knobs[] = {{"reps", 1, nullptr, 'r'}, {"sample-ms", 1, nullptr, 'm'},
-                                       {"scale", 1, nullptr, 's'}, {"out", 1, nullptr, 'o'},
-                                       {"clock", 1, nullptr, 'c'}, {"only", 1, nullptr, 'n'}, {}};
+        static const option knobs[] = {{"reps", 1, nullptr, 'r'},
+                                       {"sample-ms", 1, nullptr, 'm'},
+                                       {"scale", 1, nullptr, 's'},
+                                       {"out", 1, nullptr, 'o'},
+                                       {"clock", 1, nullptr, 'c'},
+                                       {"only", 1, nullptr, 'n'},
+                                       {}};
         Options o;
-        for (int c; (c = getopt_long(argc, argv, "", knobs, nullptr)) != -1 || optind < argc;)
-            switch (c) {
+        for (int c; (c = getopt_long(argc, argv, "", knobs, nullptr)) != -1 || optind < argc;) switch (c) {
             case 'r': o.reps = std::max(1, atoi(optarg)); break;
             case 'm': o.sample_ms = atof(optarg); break;
             case 's': o.scale = atof(optarg); break;
             case 'o': o.out_dir = optarg; break;
-            case 'c': sample_clock() = strcmp(optarg, "wall") == 0 ? CLOCK_MONOTONIC : CLOCK_THREAD_CPUTIME_ID; break;
+            case 'c':
+                sample_clock() = strcmp(optarg, "wall") == 0 ? CLOCK_MONOTONIC : CLOCK_THREAD_CPUTIME_ID;
+                break;
             case 'n': o.only = optarg; break;
             default:
-                fprintf(stderr, "usage: %s [--reps=N] [--sample-ms=MS] [--scale=F] [--out=DIR] [--clock=cpu|wall] "
-                                "[--only=NAME]\n", argv[0]);
+                fprintf(stderr,
+                        "usage: %s [--reps=N] [--sample-ms=MS] [--scale=F] [--out=DIR] [--clock=cpu|wall] "
+                        "[--only=NAME]\n",
+                        argv[0]);
                 exit(2);
             }
         return o;
@@ -144,9 +154,9 @@ struct Column {
 };
 
 struct Row {
-    std::string label;   // first column of the table
-    double x = NAN;      // abscissa of the plot; NaN rows are left out of it
-    std::string series;  // rows of one series form one line per contender
+    std::string label;  // first column of the table
+    double x = NAN;     // abscissa of the plot; NaN rows are left out of it
+    std::string series; // rows of one series form one line per contender
     std::vector<double> median;
 };
 
@@ -228,8 +238,9 @@ inline FILE *open_out(const Options &o, const std::string &name) {
 
 inline void write_markdown(const Options &o, const Section &s) {
     FILE *f = open_out(o, s.id + ".md");
-    fprintf(f, "Median ns per operation over %d interleaved repetitions; in brackets the ratio to the best "
-               "peer of the row.\n\n| %s |",
+    fprintf(f,
+            "Median ns per operation over %d interleaved repetitions; in brackets the ratio to the best "
+            "peer of the row.\n\n| %s |",
             o.reps, s.row_head.c_str());
     for (auto &c : s.columns) fprintf(f, " %s%s |", c.name.c_str(), c.role == Role::Floor ? " (floor)" : "");
     fprintf(f, " best peer |\n|---|");
@@ -242,7 +253,8 @@ inline void write_markdown(const Options &o, const Section &s) {
         for (size_t i = 0; i < s.columns.size(); ++i) {
             double m = s.rows[r].median[i];
             bool ours = s.columns[i].role == Role::Ours;
-            fprintf(f, " %s%s (%s)%s |", ours ? "**" : "", fmt(m).c_str(), ratio(m / best).c_str(), ours ? "**" : "");
+            fprintf(f, " %s%s (%s)%s |", ours ? "**" : "", fmt(m).c_str(), ratio(m / best).c_str(),
+                    ours ? "**" : "");
         }
         fprintf(f, " %s |\n", who.empty() ? "-" : who.c_str());
     }

@@ -73,6 +73,8 @@ struct LibevLoop : Loop {
 
 } // namespace
 
-Loop *make_libev_loop(Chain &c, bool epoll) { return new LibevLoop(c, epoll ? EVBACKEND_EPOLL : EVBACKEND_SELECT); }
+Loop *make_libev_loop(Chain &c, bool epoll) {
+    return new LibevLoop(c, epoll ? EVBACKEND_EPOLL : EVBACKEND_SELECT);
+}
 
 } // namespace dispatch

@@ -131,7 +131,8 @@ struct TimerSet {
         if (order.empty()) {
             Rng shuffle{uint64_t(n)};
             for (long i = 0; i < n; ++i) order.push_back(i);
-            for (long i = n - 1; i > 0; --i) std::swap(order[size_t(i)], order[shuffle.next() % uint64_t(i + 1)]);
+            for (long i = n - 1; i > 0; --i)
+                std::swap(order[size_t(i)], order[shuffle.next() % uint64_t(i + 1)]);
         }
         for (long i : order) arm(i, far ? far_us(r) : near_us(r));
     }

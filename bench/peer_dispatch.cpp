@@ -171,11 +171,14 @@ int main(int argc, char **argv) {
     auto best = [](const Section &s) { return [&s](size_t r) { return s.best_peer(r); }; };
     auto floor = [](const Section &s) { return [&s](size_t r) { return s.at(r, "read+write"); }; };
     auto a100 = [](const Section &s) { return [&s](size_t r) { return s.rows[r].series == "A=100"; }; };
-    sel.verdicts.push_back(check(sel, "select mode at most the best select backend at every N and A", "libqorbu",
-                                 best(sel), 1.0));
-    sel.verdicts.push_back(check(sel, "A=100 within 2x of the read+write floor", "libqorbu", floor(sel), 2.0, a100(sel)));
-    ep.verdicts.push_back(check(ep, "epoll mode within 1.1x of the best epoll peer", "libqorbu", best(ep), 1.1));
-    ep.verdicts.push_back(check(ep, "A=100 within 2x of the read+write floor", "libqorbu", floor(ep), 2.0, a100(ep)));
+    sel.verdicts.push_back(check(sel, "select mode at most the best select backend at every N and A",
+                                 "libqorbu", best(sel), 1.0));
+    sel.verdicts.push_back(
+        check(sel, "A=100 within 2x of the read+write floor", "libqorbu", floor(sel), 2.0, a100(sel)));
+    ep.verdicts.push_back(
+        check(ep, "epoll mode within 1.1x of the best epoll peer", "libqorbu", best(ep), 1.1));
+    ep.verdicts.push_back(
+        check(ep, "A=100 within 2x of the read+write floor", "libqorbu", floor(ep), 2.0, a100(ep)));
     write(o, sel);
     write(o, ep);
     return 0;

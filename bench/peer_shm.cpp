@@ -197,9 +197,17 @@ int main(int argc, char **argv) {
     Heap *heaps[] = {&q_nolock, &q_lock, &bh, &mh, &fh};
     std::vector<std::unique_ptr<Workload>> ws;
     for (Heap *h : heaps) ws.emplace_back(new Workload(h, kLive, 7));
-    Section one{"shm_one_process", "block size (bytes)", "block size (bytes)", true,
-                {{"libqorbu", Role::Ours}, {"libqorbu+flock", Role::Ours}, {"Boost.Interprocess", Role::Peer},
-                 {"glibc malloc", Role::Floor}, {"4 flock calls", Role::Floor}}, {}, {}};
+    Section one{"shm_one_process",
+                "block size (bytes)",
+                "block size (bytes)",
+                true,
+                {{"libqorbu", Role::Ours},
+                 {"libqorbu+flock", Role::Ours},
+                 {"Boost.Interprocess", Role::Peer},
+                 {"glibc malloc", Role::Floor},
+                 {"4 flock calls", Role::Floor}},
+                {},
+                {}};
     auto figure = [&](uint32_t size) {
         std::vector<Contender> cs;
         for (size_t i = 0; i < ws.size(); ++i) {
@@ -208,13 +216,21 @@ int main(int argc, char **argv) {
         }
         return interleave(o, cs);
     };
-    for (uint32_t size : {16u, 64u, 256u, 1024u, 4096u}) one.add(std::to_string(size), size, "", figure(size));
+    for (uint32_t size : {16u, 64u, 256u, 1024u, 4096u})
+        one.add(std::to_string(size), size, "", figure(size));
     one.add("mixed 16..4096", NAN, "", figure(0));
     fprintf(stderr, "shm: one process done\n");
 
-    Section twop{"shm_two_processes", "operation", "", false,
-                 {{"libqorbu", Role::Ours}, {"Boost.Interprocess", Role::Peer}, {"glibc malloc", Role::Floor},
-                  {"4 flock calls", Role::Floor}}, {}, {}};
+    Section twop{"shm_two_processes",
+                 "operation",
+                 "",
+                 false,
+                 {{"libqorbu", Role::Ours},
+                  {"Boost.Interprocess", Role::Peer},
+                  {"glibc malloc", Role::Floor},
+                  {"4 flock calls", Role::Floor}},
+                 {},
+                 {}};
     std::string two_name = n_two;
     std::vector<Attach> attach = {
         [two_name]() -> Heap * {
@@ -225,7 +241,9 @@ int main(int argc, char **argv) {
             }
             return new QorbuHeap(h);
         },
-        [b_two]() -> Heap * { return new BoostHeap(new bip::managed_shared_memory(bip::open_only, b_two.c_str())); },
+        [b_two]() -> Heap * {
+            return new BoostHeap(new bip::managed_shared_memory(bip::open_only, b_two.c_str()));
+        },
         []() -> Heap * { return new MallocHeap; },
         []() -> Heap * { return new FlockOnly; },
     };
@@ -241,11 +259,13 @@ int main(int argc, char **argv) {
     fprintf(stderr, "shm: two processes done\n");
 
     auto boost = [](const Section &s) { return [&s](size_t r) { return s.at(r, "Boost.Interprocess"); }; };
-    one.verdicts.push_back(check(one, "without the descriptor lock at most a quarter of Boost's cost (ratio to Boost)",
-                                 "libqorbu", boost(one), 0.25));
-    one.verdicts.push_back(check(one, "with the descriptor lock at most 3x Boost's cost", "libqorbu+flock", boost(one),
-                                 3.0));
-    twop.verdicts.push_back(check(twop, "two contending processes at most Boost's cost", "libqorbu", boost(twop), 1.0));
+    one.verdicts.push_back(
+        check(one, "without the descriptor lock at most a quarter of Boost's cost (ratio to Boost)",
+              "libqorbu", boost(one), 0.25));
+    one.verdicts.push_back(
+        check(one, "with the descriptor lock at most 3x Boost's cost", "libqorbu+flock", boost(one), 3.0));
+    twop.verdicts.push_back(
+        check(twop, "two contending processes at most Boost's cost", "libqorbu", boost(twop), 1.0));
     write(o, one);
     write(o, twop);
 

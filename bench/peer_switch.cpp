@@ -106,9 +106,16 @@ int main(int argc, char **argv) {
     SelInit();
     greenthreads_init();
 
-    Section s{"switching", "operation", "", false,
-              {{"libqorbu", Role::Ours}, {"swapcontext", Role::Peer}, {"Boost.Context", Role::Peer},
-               {"sigprocmask", Role::Floor}}, {}, {}};
+    Section s{"switching",
+              "operation",
+              "",
+              false,
+              {{"libqorbu", Role::Ours},
+               {"swapcontext", Role::Peer},
+               {"Boost.Context", Role::Peer},
+               {"sigprocmask", Role::Floor}},
+              {},
+              {}};
     auto row = [&](const char *label, std::vector<void (*)(long)> bodies) {
         std::vector<Contender> cs;
         for (size_t i = 0; i < bodies.size(); ++i) cs.push_back({s.columns[i].name, timed(o, bodies[i])});
@@ -118,12 +125,13 @@ int main(int argc, char **argv) {
     row("create+finish",
         {qorbu_create_finish, uc_create_finish, boost_create_finish, [](long ops) { mask_calls(ops, 2); }});
 
-    s.verdicts.push_back(check(s, "a green-thread switch at most 1.1x a bare swapcontext", "libqorbu",
-                               [&](size_t r) { return s.at(r, "swapcontext"); }, 1.1,
-                               [&](size_t r) { return s.rows[r].label == "switch"; }));
-    s.verdicts.push_back(check(s, "create+finish with a reused record at most 1 us (ratio to 1000 ns)", "libqorbu",
-                               [](size_t) { return 1000.0; }, 1.0,
-                               [&](size_t r) { return s.rows[r].label == "create+finish"; }));
+    s.verdicts.push_back(check(
+        s, "a green-thread switch at most 1.1x a bare swapcontext", "libqorbu",
+        [&](size_t r) { return s.at(r, "swapcontext"); }, 1.1,
+        [&](size_t r) { return s.rows[r].label == "switch"; }));
+    s.verdicts.push_back(check(
+        s, "create+finish with a reused record at most 1 us (ratio to 1000 ns)", "libqorbu",
+        [](size_t) { return 1000.0; }, 1.0, [&](size_t r) { return s.rows[r].label == "create+finish"; }));
     write(o, s);
     return 0;
 }

@@ -88,7 +88,7 @@ struct timeval host_timeval_add_ms(struct timeval t, unsigned int ms);
  * second process reads all of it through a read-only handle. */
 
 #define DEMO_SUMMARY_MAGIC 0x514f5244u /* "DROQ" */
-#define DEMO_RECORD_MAGIC 0x434f5244u  /* "DROC" */
+#define DEMO_RECORD_MAGIC  0x434f5244u /* "DROC" */
 
 /* Lives at ShmMetadata(handle, sizeof(DemoSummary)). */
 typedef struct DemoSummary {
@@ -96,8 +96,8 @@ typedef struct DemoSummary {
     int32_t pid;               /* the daemon that owns the segment */
     uint32_t open_connections; /* records in the list */
     uint32_t accepted_total;
-    uint64_t bytes_echoed;     /* over all connections, closed ones included */
-    uintptr_t records;         /* address of the newest record, 0 when none */
+    uint64_t bytes_echoed; /* over all connections, closed ones included */
+    uintptr_t records;     /* address of the newest record, 0 when none */
 } DemoSummary;
 
 /* One per open connection, in the data area. */
@@ -105,10 +105,10 @@ typedef struct DemoConnection {
     uint32_t magic;
     int32_t fd;
     uint32_t peer_port;
-    uint32_t serial;           /* 1 for the first connection accepted */
+    uint32_t serial; /* 1 for the first connection accepted */
     uint64_t bytes_echoed;
-    uintptr_t next;            /* older record, 0 at the end */
-    uintptr_t prev;            /* newer record, 0 at the head */
+    uintptr_t next; /* older record, 0 at the end */
+    uintptr_t prev; /* newer record, 0 at the head */
 } DemoConnection;
 
 /* The default data area address: one a fresh process is not likely to use,
@@ -133,7 +133,7 @@ typedef struct EchoService {
     int listen_fd;
     struct sockaddr_in address; /* where it listens */
     int stopping;
-    Greenthread *idle_waiter;   /* woken when the last connection has closed */
+    Greenthread *idle_waiter; /* woken when the last connection has closed */
 } EchoService;
 
 /* Listens on 127.0.0.1:port (0: any free port) and starts the accepting
@@ -151,10 +151,10 @@ void echo_wait_idle(EchoService *svc);
  * no thread, no signal handler, no system configuration or state files. */
 
 /* The scalars, instances .0 under netSnmpPlaypen (1.3.6.1.4.1.8072.9999.9999). */
-#define DEMO_OID_BASE "1.3.6.1.4.1.8072.9999.9999.7"
+#define DEMO_OID_BASE             "1.3.6.1.4.1.8072.9999.9999.7"
 #define DEMO_OID_OPEN_CONNECTIONS DEMO_OID_BASE ".1.0" /* Gauge32 */
-#define DEMO_OID_BYTES_ECHOED DEMO_OID_BASE ".2.0"     /* Counter64 */
-#define DEMO_OID_SEGMENT_FREE DEMO_OID_BASE ".3.0"     /* Gauge32 */
+#define DEMO_OID_BYTES_ECHOED     DEMO_OID_BASE ".2.0" /* Counter64 */
+#define DEMO_OID_SEGMENT_FREE     DEMO_OID_BASE ".3.0" /* Gauge32 */
 
 /* Starts the agent on udp:127.0.0.1:*port (0: a free port, stored there),
  * with Net-SNMP's state in a private directory; the values are read from

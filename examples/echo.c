@@ -25,13 +25,14 @@ typedef struct Connection {
 
 static DemoConnection *record_open(EchoService *svc, int fd, unsigned int peer_port) {
     DemoConnection *record = ShmAlloc(svc->segment, sizeof *record);
-    if (!record)
-        return NULL;
+    if (!record) return NULL;
     DemoSummary *summary = svc->summary;
-    *record = (DemoConnection){.magic = DEMO_RECORD_MAGIC, .fd = fd, .peer_port = peer_port,
-                               .serial = ++summary->accepted_total, .next = summary->records};
-    if (summary->records)
-        ((DemoConnection *)summary->records)->prev = (uintptr_t)record;
+    *record = (DemoConnection){.magic = DEMO_RECORD_MAGIC,
+                               .fd = fd,
+                               .peer_port = peer_port,
+                               .serial = ++summary->accepted_total,
+                               .next = summary->records};
+    if (summary->records) ((DemoConnection *)summary->records)->prev = (uintptr_t)record;
     summary->records = (uintptr_t)record;
     ++summary->open_connections;
     return record;
@@ -43,8 +44,7 @@ static void record_close(EchoService *svc, DemoConnection *record) {
         ((DemoConnection *)record->prev)->next = record->next;
     else
         summary->records = record->next;
-    if (record->next)
-        ((DemoConnection *)record->next)->prev = record->prev;
+    if (record->next) ((DemoConnection *)record->next)->prev = record->prev;
     record->magic = 0;
     ShmFree(svc->segment, record);
     if (--summary->open_connections == 0 && svc->idle_waiter) {
@@ -90,8 +90,7 @@ static void accept_connections(void *arg) {
         socklen_t len = sizeof peer;
         int fd = nb_accept(svc->listen_fd, (struct sockaddr *)&peer, &len);
         if (fd < 0) {
-            if (svc->stopping || errno == EINTR || errno == ECONNABORTED || errno == EPROTO)
-                continue;
+            if (svc->stopping || errno == EINTR || errno == ECONNABORTED || errno == EPROTO) continue;
             perror("qorbu-demo: accept");
             break;
         }
@@ -106,16 +105,15 @@ static void accept_connections(void *arg) {
 
 int echo_start(EchoService *svc, ShmHandle *segment, DemoSummary *summary, unsigned int port) {
     *svc = (EchoService){.segment = segment, .summary = summary, .listen_fd = -1};
-    svc->address = (struct sockaddr_in){.sin_family = AF_INET, .sin_port = htons((uint16_t)port),
-                                        .sin_addr.s_addr = htonl(INADDR_LOOPBACK)};
+    svc->address = (struct sockaddr_in){
+        .sin_family = AF_INET, .sin_port = htons((uint16_t)port), .sin_addr.s_addr = htonl(INADDR_LOOPBACK)};
     socklen_t len = sizeof svc->address;
     int on = 1, fd = socket(AF_INET, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (fd < 0 || setsockopt(fd, SOL_SOCKET, SO_REUSEADDR, &on, sizeof on) != 0 ||
         bind(fd, (struct sockaddr *)&svc->address, len) != 0 || listen(fd, kListenBacklog) != 0 ||
         getsockname(fd, (struct sockaddr *)&svc->address, &len) != 0) {
         fprintf(stderr, "qorbu-demo: cannot listen on 127.0.0.1:%u: %s\n", port, strerror(errno));
-        if (fd >= 0)
-            close(fd);
+        if (fd >= 0) close(fd);
         return -1;
     }
     svc->listen_fd = fd;
@@ -124,13 +122,11 @@ int echo_start(EchoService *svc, ShmHandle *segment, DemoSummary *summary, unsig
 }
 
 void echo_stop(EchoService *svc) {
-    if (svc->stopping)
-        return;
+    if (svc->stopping) return;
     svc->stopping = 1;
     /* A shut-down socket turns readable (and writable): every green thread
      * waiting on one wakes up, sees end of file or an error, and finishes. */
-    if (svc->listen_fd >= 0)
-        shutdown(svc->listen_fd, SHUT_RDWR);
+    if (svc->listen_fd >= 0) shutdown(svc->listen_fd, SHUT_RDWR);
     for (uintptr_t at = svc->summary->records; at; at = ((DemoConnection *)at)->next)
         shutdown(((DemoConnection *)at)->fd, SHUT_RDWR);
 }

@@ -37,8 +37,7 @@ void host_destroy(HostContext *host) {
 
 int host_post(HostContext *host, HostTaskFn fn, void *arg) {
     HostQueued *item = malloc(sizeof *item);
-    if (!item)
-        return -1;
+    if (!item) return -1;
     *item = (HostQueued){.next = NULL, .task = {fn, arg}};
     *(host->queue_tail ? &host->queue_tail->next : &host->queue_head) = item;
     host->queue_tail = item;
@@ -57,16 +56,14 @@ struct timeval host_timeval_add_ms(struct timeval t, unsigned int ms) {
 
 HostTimed *host_after(HostContext *host, HostList list, unsigned int ms, HostTaskFn fn, void *arg) {
     HostTimed *task = (unsigned int)list < HOST_LIST_COUNT ? calloc(1, sizeof *task) : NULL;
-    if (!task)
-        return NULL;
+    if (!task) return NULL;
     pal_time_tzcurrent(&task->link.when, NULL);
     task->link.when = host_timeval_add_ms(task->link.when, ms);
     task->fn = fn;
     task->arg = arg;
     /* Earliest first; a new task goes after every task due at the same time. */
     SelHostTask **link = &host->scheduler.timed[list];
-    while (*link && timeval_cmp((*link)->when, task->link.when) <= 0)
-        link = &(*link)->next;
+    while (*link && timeval_cmp((*link)->when, task->link.when) <= 0) link = &(*link)->next;
     task->link.next = *link;
     *link = &task->link;
     return task;
@@ -92,8 +89,7 @@ int host_watch_fd(HostContext *host, int fd, HostTaskFn fn, void *arg) {
     }
     host->watches[fd] = (HostTaskRecord){fn, arg};
     FD_SET(fd, &host->scheduler.readfd);
-    if (fd > host->scheduler.max_fd)
-        host->scheduler.max_fd = fd;
+    if (fd > host->scheduler.max_fd) host->scheduler.max_fd = fd;
     return 0;
 }
 
@@ -102,11 +98,9 @@ int host_watch_fd(HostContext *host, int fd, HostTaskFn fn, void *arg) {
 int thread_fetch_queued(void *context, void *task) {
     HostContext *host = context;
     HostQueued *item = host->queue_head;
-    if (!item)
-        return 0;
+    if (!item) return 0;
     host->queue_head = item->next;
-    if (!host->queue_head)
-        host->queue_tail = NULL;
+    if (!host->queue_head) host->queue_tail = NULL;
     memcpy(task, &item->task, sizeof item->task);
     free(item);
     return 1;
@@ -139,8 +133,7 @@ static int queue_due_timed(HostContext *host) {
         SelHostTask *head;
         while ((head = host->scheduler.timed[list]) && timeval_cmp(head->when, now) <= 0) {
             HostTimed *task = (HostTimed *)head;
-            if (host_post(host, task->fn, task->arg) != 0)
-                break; /* out of memory: try again next pass */
+            if (host_post(host, task->fn, task->arg) != 0) break; /* out of memory: try again next pass */
             host->scheduler.timed[list] = head->next;
             free(task);
             ++queued;
@@ -152,8 +145,7 @@ static int queue_due_timed(HostContext *host) {
 int thread_select_nb(void *context) { return queue_readable_watches(context) + queue_due_timed(context); }
 
 int timeval_cmp(struct timeval a, struct timeval b) {
-    if (a.tv_sec != b.tv_sec)
-        return a.tv_sec < b.tv_sec ? -1 : 1;
+    if (a.tv_sec != b.tv_sec) return a.tv_sec < b.tv_sec ? -1 : 1;
     return a.tv_usec < b.tv_usec ? -1 : a.tv_usec > b.tv_usec;
 }
 

@@ -18,8 +18,7 @@ static long long count_free(ShmHandle *segment) {
     char *dump = NULL;
     size_t size = 0;
     FILE *out = open_memstream(&dump, &size);
-    if (!out)
-        return -1;
+    if (!out) return -1;
     errno = 0;
     ShmPrintFree(out, segment->base);
     int damaged = errno != 0 || ferror(out);
@@ -31,8 +30,7 @@ static long long count_free(ShmHandle *segment) {
         ++lines;
         const char *list = strchr(line, '{');
         damaged = !list || sscanf(line, "0x%x", &block) != 1;
-        for (const char *at = list; !damaged && (at = strstr(at + 1, "0x"));)
-            total += block;
+        for (const char *at = list; !damaged && (at = strstr(at + 1, "0x"));) total += block;
     }
     free(dump);
     const unsigned int classes = sizeof segment->base->freeList / sizeof segment->base->freeList[0];
@@ -44,8 +42,7 @@ static int walk_records(const DemoSummary *summary, unsigned int *records, unsig
     *bytes = 0;
     for (uintptr_t at = summary->records; at; at = ((const DemoConnection *)at)->next) {
         const DemoConnection *record = (const DemoConnection *)at;
-        if (record->magic != DEMO_RECORD_MAGIC || *records > summary->open_connections)
-            return -1;
+        if (record->magic != DEMO_RECORD_MAGIC || *records > summary->open_connections) return -1;
         ++*records;
         *bytes += record->bytes_echoed;
     }

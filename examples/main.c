@@ -62,21 +62,25 @@ static const struct option kOptions[] = {
 static const struct {
     unsigned long standard, self_test, min, max;
 } kNumeric[kNumericCount] = {
-    {7007, 0, 0, 65535},                                              /* port */
-    {1161, 0, 0, 65535},                                              /* snmp-port */
-    {DEMO_SEGMENT_SIZE, DEMO_SEGMENT_SIZE, 4096, 0x40000000ul},       /* segment-size */
+    {7007, 0, 0, 65535},                                             /* port */
+    {1161, 0, 0, 65535},                                             /* snmp-port */
+    {DEMO_SEGMENT_SIZE, DEMO_SEGMENT_SIZE, 4096, 0x40000000ul},      /* segment-size */
     {DEMO_SEGMENT_ADDRESS, DEMO_SEGMENT_ADDRESS, 4096, UINTPTR_MAX}, /* segment-address */
-    {5000, 500, 10, 3600000},                                         /* status-interval */
-    {8, 8, 1, 500},                                                   /* clients */
-    {64, 64, 1, 100000},                                              /* rounds */
+    {5000, 500, 10, 3600000},                                        /* status-interval */
+    {8, 8, 1, 500},                                                  /* clients */
+    {64, 64, 1, 100000},                                             /* rounds */
 };
 
 /* 0: run; 1: done (help printed); -1: bad command line. */
 static int parse_options(int argc, char **argv, DemoOptions *options) {
     static char self_test_name[64];
-    unsigned long *const field[kNumericCount] = {&options->port, &options->snmp_port, &options->segment_size,
-                                                 &options->segment_address, &options->status_interval_ms,
-                                                 &options->clients, &options->rounds};
+    unsigned long *const field[kNumericCount] = {&options->port,
+                                                 &options->snmp_port,
+                                                 &options->segment_size,
+                                                 &options->segment_address,
+                                                 &options->status_interval_ms,
+                                                 &options->clients,
+                                                 &options->rounds};
     int given[kNumericCount] = {0}, option;
     opterr = 0;
     while ((option = getopt_long(argc, argv, "h", kOptions, NULL)) != -1) {
@@ -107,8 +111,7 @@ static int parse_options(int argc, char **argv, DemoOptions *options) {
         return -1;
     }
     for (int k = 0; k < kNumericCount; ++k)
-        if (!given[k])
-            *field[k] = options->self_test ? kNumeric[k].self_test : kNumeric[k].standard;
+        if (!given[k]) *field[k] = options->self_test ? kNumeric[k].self_test : kNumeric[k].standard;
     if (options->segment_address % 4096 != 0) {
         fprintf(stderr, "qorbu-demo: --segment-address must be a multiple of 4096\n");
         return -1;
@@ -131,13 +134,15 @@ static int create_segment(Demo *demo) {
     int fd = shm_open(object, O_RDONLY, 0);
     if (fd >= 0) {
         close(fd);
-        fprintf(stderr, "qorbu-demo: segment %s already exists (another qorbu-demo? remove it with "
-                        "'qorbu-shm unlink %s')\n", options->segment_name, options->segment_name);
+        fprintf(stderr,
+                "qorbu-demo: segment %s already exists (another qorbu-demo? remove it with "
+                "'qorbu-shm unlink %s')\n",
+                options->segment_name, options->segment_name);
         return -1;
     }
     demo->segment = ShmCreate(options->segment_name, (void *)options->segment_address, options->segment_size);
     if (!demo->segment && errno == EEXIST) { /* the library never maps over memory in use */
-        ShmUnlink(options->segment_name);        /* the object it made stays unsized: remove it */
+        ShmUnlink(options->segment_name);    /* the object it made stays unsized: remove it */
         fprintf(stderr, "qorbu-demo: the address range at %#lx is in use; choose --segment-address\n",
                 options->segment_address - (unsigned long)ShmOverhead());
         return -1;
@@ -166,8 +171,7 @@ static void log_status(Demo *demo) {
 static int on_status_timer(SelTimer *timer) {
     Demo *demo = timer->arg;
     log_status(demo);
-    if (!demo->stopping)
-        SelSleep(timer, demo->options.status_interval_ms);
+    if (!demo->stopping) SelSleep(timer, demo->options.status_interval_ms);
     return 0;
 }
 
@@ -181,19 +185,16 @@ static void on_stop_grace_expired(void *arg) {
 
 static void stop_now(void *arg) {
     Demo *demo = arg;
-    if (demo->stopping)
-        return;
+    if (demo->stopping) return;
     demo->stopping = 1;
     SelRemTimer(&demo->status_timer);
     echo_stop(&demo->echo);
-    if (demo->test)
-        selftest_stop(demo->test);
+    if (demo->test) selftest_stop(demo->test);
     host_after(&demo->host, HOST_LIST_URGENT, kStopGraceMs, on_stop_grace_expired, demo);
 }
 
 void demo_request_stop(Demo *demo, const char *reason) {
-    if (!demo->stopping)
-        fprintf(stderr, "qorbu-demo: stopping: %s\n", reason);
+    if (!demo->stopping) fprintf(stderr, "qorbu-demo: stopping: %s\n", reason);
     host_post(&demo->host, stop_now, demo);
 }
 
@@ -212,16 +213,13 @@ static void on_signal_pipe(void *arg) {
     Demo *demo = arg;
     unsigned char bytes[16];
     ssize_t n = read(demo->signal_pipe[0], bytes, sizeof bytes);
-    if (n > 0)
-        demo_request_stop(demo, bytes[n - 1] == SIGINT ? "SIGINT" : "SIGTERM");
+    if (n > 0) demo_request_stop(demo, bytes[n - 1] == SIGINT ? "SIGINT" : "SIGTERM");
 }
 
 static int install_signals(Demo *demo) {
-    if (pipe2(demo->signal_pipe, O_CLOEXEC | O_NONBLOCK) != 0)
-        return -1;
+    if (pipe2(demo->signal_pipe, O_CLOEXEC | O_NONBLOCK) != 0) return -1;
     signal_write_fd = demo->signal_pipe[1];
-    if (host_watch_fd(&demo->host, demo->signal_pipe[0], on_signal_pipe, demo) != 0)
-        return -1;
+    if (host_watch_fd(&demo->host, demo->signal_pipe[0], on_signal_pipe, demo) != 0) return -1;
     /* No SA_RESTART: the select loop's wait returns with EINTR. The signals
      * stay blocked except during that wait (SelAddSignal). */
     struct sigaction action = {.sa_handler = on_signal};
@@ -252,16 +250,15 @@ static int start(Demo *demo) {
     /* After SelAddSignal: every green thread starts with the registered
      * signals blocked, like the main context. */
     greenthreads_init();
-    if (echo_start(&demo->echo, demo->segment, demo->summary, demo->options.port) != 0)
-        return -1;
+    if (echo_start(&demo->echo, demo->segment, demo->summary, demo->options.port) != 0) return -1;
     demo->status_timer = (SelTimer){.callback = on_status_timer, .arg = demo};
     SelSleep(&demo->status_timer, demo->options.status_interval_ms);
-    fprintf(stderr, "qorbu-demo: pid %d, echo on 127.0.0.1:%u, SNMP on udp:127.0.0.1:%u, segment %s "
-                    "(%u bytes free)\n",
+    fprintf(stderr,
+            "qorbu-demo: pid %d, echo on 127.0.0.1:%u, SNMP on udp:127.0.0.1:%u, segment %s "
+            "(%u bytes free)\n",
             (int)getpid(), (unsigned int)ntohs(demo->echo.address.sin_port), demo->snmp_port,
             demo->options.segment_name, demo->free_at_start);
-    if (demo->options.self_test && !(demo->test = selftest_start(demo)))
-        return -1;
+    if (demo->options.self_test && !(demo->test = selftest_start(demo))) return -1;
     return 0;
 }
 
@@ -296,9 +293,7 @@ static int run_daemon(Demo *demo) {
 int main(int argc, char **argv) {
     static Demo demo;
     const int parsed = parse_options(argc, argv, &demo.options);
-    if (parsed != 0)
-        return parsed > 0 ? kExitOk : kExitUsage;
-    if (demo.options.inspect)
-        return inspect_segment(demo.options.inspect);
+    if (parsed != 0) return parsed > 0 ? kExitOk : kExitUsage;
+    if (demo.options.inspect) return inspect_segment(demo.options.inspect);
     return run_daemon(&demo);
 }

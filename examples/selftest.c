@@ -76,8 +76,7 @@ static uint32_t next_random(uint32_t *state) {
 
 static int echo_round(Client *client) {
     size_t len = 1 + next_random(&client->random) % kMaxChunk;
-    for (size_t i = 0; i < len; ++i)
-        client->out[i] = (unsigned char)next_random(&client->random);
+    for (size_t i = 0; i < len; ++i) client->out[i] = (unsigned char)next_random(&client->random);
     if (nb_write(client->fd, client->out, len) != (int)len ||
         nb_readall(client->fd, client->in, len) != (int)len || memcmp(client->out, client->in, len) != 0)
         return -1;
@@ -94,12 +93,10 @@ static void run_client(void *arg) {
     if (client->fd >= 0 && nb_connect(client->fd, (const struct sockaddr *)to, sizeof *to) == 0) {
         client->connected = 1;
         unsigned long round = 0;
-        while (round < test->demo->options.rounds && !test->stopping && echo_round(client) == 0)
-            ++round;
+        while (round < test->demo->options.rounds && !test->stopping && echo_round(client) == 0) ++round;
         client->verified = round == test->demo->options.rounds;
     }
-    if (--test->pending == 0)
-        greenthread_wakeup(test->controller);
+    if (--test->pending == 0) greenthread_wakeup(test->controller);
     /* Stay connected until the controller has looked at the segment and
      * the agent, so that every connection is visible there. */
     while (!test->released) {
@@ -107,15 +104,13 @@ static void run_client(void *arg) {
         greenthread_block();
     }
     client->waiting = NULL;
-    if (client->fd >= 0)
-        close(client->fd);
+    if (client->fd >= 0) close(client->fd);
     client->fd = -1;
 }
 
 static void release_clients(SelfTest *test) {
     test->released = 1;
-    for (unsigned int i = 0; i < test->client_count; ++i)
-        greenthread_wakeup(test->clients[i].waiting);
+    for (unsigned int i = 0; i < test->client_count; ++i) greenthread_wakeup(test->clients[i].waiting);
 }
 
 /* ---- snmpget and the second process --------------------------------------- */
@@ -178,10 +173,8 @@ static int spawn_capture(char *const argv[], char *out, size_t cap) {
     }
     const int silent = read_output(fds[0], out, cap) != 0;
     close(fds[0]);
-    if (silent)
-        kill(pid, SIGKILL);
-    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {
-    }
+    if (silent) kill(pid, SIGKILL);
+    while (waitpid(pid, &status, 0) < 0 && errno == EINTR) {}
     if (silent)
         snprintf(out, cap, "%s gave no answer within %d ms", argv[0], kHelperTimeoutMs);
     else if (!WIFEXITED(status))
@@ -194,8 +187,7 @@ static int parse_snmp_value(const char *output, const char *oid, unsigned long l
     snprintf(prefix, sizeof prefix, ".%s = ", oid);
     const char *line = strstr(output, prefix);
     const char *colon = line ? strchr(line + strlen(prefix), ':') : NULL;
-    if (!colon)
-        return -1;
+    if (!colon) return -1;
     char *end;
     errno = 0;
     *value = strtoull(colon + 1, &end, 10);
@@ -205,8 +197,20 @@ static int parse_snmp_value(const char *output, const char *oid, unsigned long l
 static void query_agent(SelfTest *test) {
     char target[48], output[kHelperOutputSize];
     snprintf(target, sizeof target, "udp:127.0.0.1:%u", test->demo->snmp_port);
-    char *argv[] = {"snmpget", "-v2c", "-c", "public", "-On", "-t", "2", "-r", "2", target,
-                    DEMO_OID_OPEN_CONNECTIONS, DEMO_OID_BYTES_ECHOED, DEMO_OID_SEGMENT_FREE, NULL};
+    char *argv[] = {"snmpget",
+                    "-v2c",
+                    "-c",
+                    "public",
+                    "-On",
+                    "-t",
+                    "2",
+                    "-r",
+                    "2",
+                    target,
+                    DEMO_OID_OPEN_CONNECTIONS,
+                    DEMO_OID_BYTES_ECHOED,
+                    DEMO_OID_SEGMENT_FREE,
+                    NULL};
     int status = spawn_capture(argv, output, sizeof output);
     SnmpAnswers *snmp = &test->snmp;
     snmp->ok = status == 0 &&
@@ -346,8 +350,7 @@ static void run_controller(void *arg) {
 static void on_deadline(void *arg) {
     SelfTest *test = arg;
     test->deadline = NULL;
-    if (test->finished)
-        return;
+    if (test->finished) return;
     fprintf(stderr, "qorbu-demo: the self-test did not finish within %d ms\n", kDeadlineMs);
     test->timed_out = 1;
     demo_request_stop(test->demo, "self-test deadline");
@@ -379,12 +382,10 @@ SelfTest *selftest_start(Demo *demo) {
 }
 
 void selftest_stop(SelfTest *test) {
-    if (test->finished || test->stopping)
-        return;
+    if (test->finished || test->stopping) return;
     test->stopping = 1;
     for (unsigned int i = 0; i < test->client_count; ++i)
-        if (test->clients[i].fd >= 0)
-            shutdown(test->clients[i].fd, SHUT_RDWR);
+        if (test->clients[i].fd >= 0) shutdown(test->clients[i].fd, SHUT_RDWR);
     release_clients(test);
 }
 
@@ -393,10 +394,8 @@ int selftest_passed(const SelfTest *test) {
 }
 
 void selftest_free(SelfTest *test) {
-    if (!test)
-        return;
-    if (test->deadline)
-        host_cancel(&test->demo->host, test->deadline);
+    if (!test) return;
+    if (test->deadline) host_cancel(&test->demo->host, test->deadline);
     free(test->clients);
     free(test);
 }

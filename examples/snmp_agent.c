@@ -28,8 +28,7 @@ enum Scalar { SCALAR_OPEN_CONNECTIONS = 1, SCALAR_BYTES_ECHOED = 2, SCALAR_SEGME
 static int answer_scalar(netsnmp_mib_handler *handler, netsnmp_handler_registration *reg,
                          netsnmp_agent_request_info *reqinfo, netsnmp_request_info *requests) {
     (void)reg;
-    if (reqinfo->mode != MODE_GET)
-        return SNMP_ERR_NOERROR;
+    if (reqinfo->mode != MODE_GET) return SNMP_ERR_NOERROR;
     const enum Scalar object = (enum Scalar)(uintptr_t)handler->myvoid;
     for (netsnmp_request_info *request = requests; request; request = request->next) {
         if (object == SCALAR_BYTES_ECHOED) {
@@ -50,8 +49,7 @@ static int register_scalar(const char *name, enum Scalar object) {
     oid root[] = {1, 3, 6, 1, 4, 1, 8072, 9999, 9999, 7, (oid)object};
     netsnmp_handler_registration *reg = netsnmp_create_handler_registration(
         name, answer_scalar, root, sizeof root / sizeof root[0], HANDLER_CAN_RONLY);
-    if (!reg)
-        return -1;
+    if (!reg) return -1;
     reg->handler->myvoid = (void *)(uintptr_t)object;
     return netsnmp_register_scalar(reg) == MIB_REGISTERED_OK ? 0 : -1;
 }
@@ -80,8 +78,7 @@ static void configure_library(unsigned int port) {
 /* A UDP port on 127.0.0.1 that was free a moment ago, or 0. */
 static unsigned int pick_free_port(void) {
     int fd = socket(AF_INET, SOCK_DGRAM | SOCK_CLOEXEC, 0);
-    if (fd < 0)
-        return 0;
+    if (fd < 0) return 0;
     struct sockaddr_in addr = {.sin_family = AF_INET, .sin_addr.s_addr = htonl(INADDR_LOOPBACK)};
     socklen_t len = sizeof addr;
     unsigned int port = 0;
@@ -110,8 +107,7 @@ int agent_start(ShmHandle *shm, const DemoSummary *shared, unsigned int *port) {
     /* Warnings and errors on standard error; no line per request. */
     snmp_disable_log();
     netsnmp_log_handler *log = netsnmp_register_loghandler(NETSNMP_LOGHANDLER_STDERR, LOG_WARNING);
-    if (log)
-        log->pri_max = LOG_EMERG;
+    if (log) log->pri_max = LOG_EMERG;
     netsnmp_ds_set_boolean(NETSNMP_DS_APPLICATION_ID, NETSNMP_DS_AGENT_DONT_LOG_TCPWRAPPERS_CONNECTS, 1);
     configure_library(*port);
 
@@ -146,7 +142,6 @@ void agent_stop(void) {
         snmp_shutdown(kAppName);
         shutdown_agent();
     }
-    if (made_state_dir)
-        nftw(state_dir, remove_entry, 8, FTW_DEPTH | FTW_PHYS);
+    if (made_state_dir) nftw(state_dir, remove_entry, 8, FTW_DEPTH | FTW_PHYS);
     started = made_state_dir = 0;
 }

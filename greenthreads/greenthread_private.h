@@ -34,7 +34,7 @@ struct Greenthread {
     GreenthreadEntry entry;
     void *arg;
 #ifdef QORBU_GT_TSAN
-    void *tsan_fiber;   /* ThreadSanitizer builds only */
+    void *tsan_fiber; /* ThreadSanitizer builds only */
 #endif
 };
 

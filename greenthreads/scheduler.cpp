@@ -39,8 +39,7 @@ const void *main_stack_bottom;
 size_t main_stack_size;
 Greenthread *switched_from;
 
-void asan_leave(void **fake_stack_save, Greenthread *to)
-{
+void asan_leave(void **fake_stack_save, Greenthread *to) {
     if (to == main_thread) {
         __sanitizer_start_switch_fiber(fake_stack_save, main_stack_bottom, main_stack_size);
         return;
@@ -50,8 +49,7 @@ void asan_leave(void **fake_stack_save, Greenthread *to)
                                    stack.ss_size - static_cast<size_t>(page_size));
 }
 
-void asan_arrive(void *fake_stack_save)
-{
+void asan_arrive(void *fake_stack_save) {
     const void *bottom = nullptr;
     size_t size = 0;
     __sanitizer_finish_switch_fiber(fake_stack_save, &bottom, &size);
@@ -64,8 +62,7 @@ void asan_arrive(void *fake_stack_save)
 
 /* Saves the caller in its record and resumes `to`. A finishing thread never
  * comes back, so its sanitizer bookkeeping is released on the way out. */
-int switch_context(Greenthread *from, Greenthread *to, [[maybe_unused]] bool finishing)
-{
+int switch_context(Greenthread *from, Greenthread *to, [[maybe_unused]] bool finishing) {
 #ifdef QORBU_GT_TSAN
     __tsan_switch_to_fiber(to->tsan_fiber, 0);
 #endif
@@ -81,47 +78,38 @@ int switch_context(Greenthread *from, Greenthread *to, [[maybe_unused]] bool fin
 #endif
 }
 
-void announce_thread_start()
-{
+void announce_thread_start() {
 #ifdef QORBU_GT_ASAN
     asan_arrive(nullptr);
 #endif
 }
 
-void prepare_tsan_fiber([[maybe_unused]] Greenthread *thread, [[maybe_unused]] bool reused)
-{
+void prepare_tsan_fiber([[maybe_unused]] Greenthread *thread, [[maybe_unused]] bool reused) {
 #ifdef QORBU_GT_TSAN
-    if (reused)
-        __tsan_destroy_fiber(thread->tsan_fiber);
+    if (reused) __tsan_destroy_fiber(thread->tsan_fiber);
     thread->tsan_fiber = __tsan_create_fiber(0);
 #endif
 }
 
 /* --- run queue ---------------------------------------------------------- */
 
-Greenthread *run_queue_take()
-{
+Greenthread *run_queue_take() {
     Greenthread *head = run_queue_head;
-    if (head == nullptr)
-        return nullptr;
+    if (head == nullptr) return nullptr;
     run_queue_head = head->next;
-    if (run_queue_tail == head)
-        run_queue_tail = nullptr;
+    if (run_queue_tail == head) run_queue_tail = nullptr;
     return head;
 }
 
-void run_queue_push_front(Greenthread *thread)
-{
+void run_queue_push_front(Greenthread *thread) {
     thread->next = run_queue_head;
     run_queue_head = thread;
-    if (run_queue_tail == nullptr)
-        run_queue_tail = thread;
+    if (run_queue_tail == nullptr) run_queue_tail = thread;
 }
 
 /* A failed switch leaves the caller running and runnable, and the record it
  * meant to resume back at the head of the queue. */
-void undo_switch(Greenthread *self, Greenthread *next, Greenthread *tail_before, bool self_queued)
-{
+void undo_switch(Greenthread *self, Greenthread *next, Greenthread *tail_before, bool self_queued) {
     fprintf(stderr, "swapcontext() failed: %s\n", strerror(errno));
     if (self_queued) {
         run_queue_tail = tail_before;
@@ -137,8 +125,7 @@ void undo_switch(Greenthread *self, Greenthread *next, Greenthread *tail_before,
 
 /* Takes the head of the queue before queueing the caller: the same order as
  * queueing first, without switching to oneself when nothing else waits. */
-void switch_to_next(bool finishing)
-{
+void switch_to_next(bool finishing) {
     Greenthread *self = current_thread;
     Greenthread *next = run_queue_take();
     if (next == nullptr) {
@@ -149,18 +136,15 @@ void switch_to_next(bool finishing)
     }
     Greenthread *const tail_before = run_queue_tail;
     const bool self_queued = self->runnable == kRunnable;
-    if (self_queued)
-        run_queue_append(self);
+    if (self_queued) run_queue_append(self);
     current_thread = next;
-    if (switch_context(self, next, finishing) != 0)
-        undo_switch(self, next, tail_before, self_queued);
+    if (switch_context(self, next, finishing) != 0) undo_switch(self, next, tail_before, self_queued);
 }
 
 /* Every green thread waits: in epoll mode the pass sleeps until a
  * descriptor or a signal wakes it even when no timer is armed, rather than
  * come straight back and spin. */
-void wait_in_selector()
-{
+void wait_in_selector() {
     if (GetEpollFd() != 0)
         qorbu::sel::epoll_pass(true);
     else
@@ -169,21 +153,14 @@ void wait_in_selector()
 
 /* Record allocation and stack mapping failures are fatal by design: a
  * process that catches or ignores the signal gets a null thread instead. */
-void raise_out_of_memory()
-{
-    kill(getpid(), SIGSEGV);
-}
+void raise_out_of_memory() { kill(getpid(), SIGSEGV); }
 
 /* Only the signal mask and the register layout are wanted from here:
  * makecontext always replaces where the context resumes, so the second
  * return of getcontext never happens and needs no setjmp-style care. */
-__attribute__((noinline)) int capture_context(ucontext_t *context)
-{
-    return getcontext(context);
-}
+__attribute__((noinline)) int capture_context(ucontext_t *context) { return getcontext(context); }
 
-Greenthread *allocate_thread()
-{
+Greenthread *allocate_thread() {
     auto *thread = static_cast<Greenthread *>(calloc(1, sizeof(Greenthread)));
     if (thread == nullptr) {
         raise_out_of_memory();
@@ -207,18 +184,15 @@ Greenthread *allocate_thread()
     return thread;
 }
 
-Greenthread *take_free_thread()
-{
+Greenthread *take_free_thread() {
     Greenthread *thread = free_threads;
-    if (thread != nullptr)
-        free_threads = thread->next;
+    if (thread != nullptr) free_threads = thread->next;
     return thread;
 }
 
 } // namespace
 
-void run_queue_append(Greenthread *thread)
-{
+void run_queue_append(Greenthread *thread) {
     thread->next = nullptr;
     if (run_queue_tail != nullptr)
         run_queue_tail->next = thread;
@@ -227,8 +201,7 @@ void run_queue_append(Greenthread *thread)
     run_queue_tail = thread;
 }
 
-void greenthread_start()
-{
+void greenthread_start() {
     announce_thread_start();
     Greenthread *self = current_thread;
     self->entry(self->arg);
@@ -245,8 +218,7 @@ void greenthread_start()
     }
 }
 
-void run_one_turn()
-{
+void run_one_turn() {
     if (run_queue_head != nullptr)
         switch_to_next(false);
     else
@@ -259,14 +231,11 @@ using namespace qorbu::gt;
 
 extern "C" {
 
-void greenthreads_init(void)
-{
-    if (main_thread != nullptr)
-        return;
+void greenthreads_init(void) {
+    if (main_thread != nullptr) return;
     page_size = sysconf(_SC_PAGESIZE);
     auto *self = static_cast<Greenthread *>(calloc(1, sizeof(Greenthread)));
-    if (self == nullptr)
-        return;
+    if (self == nullptr) return;
     self->runnable = kRunnable;
 #ifdef QORBU_GT_TSAN
     self->tsan_fiber = __tsan_get_current_fiber();
@@ -275,16 +244,14 @@ void greenthreads_init(void)
     current_thread = self;
 }
 
-Greenthread *greenthread_create(GreenthreadEntry entry, void *arg)
-{
+Greenthread *greenthread_create(GreenthreadEntry entry, void *arg) {
     if (current_thread == nullptr) {
         errno = EINVAL;
         return nullptr;
     }
     Greenthread *thread = take_free_thread();
     const bool reused = thread != nullptr;
-    if (!reused && (thread = allocate_thread()) == nullptr)
-        return nullptr;
+    if (!reused && (thread = allocate_thread()) == nullptr) return nullptr;
     prepare_tsan_fiber(thread, reused);
     thread->entry = entry;
     thread->arg = arg;
@@ -295,44 +262,32 @@ Greenthread *greenthread_create(GreenthreadEntry entry, void *arg)
     return thread;
 }
 
-void greenthread_yield(void)
-{
-    if (current_thread != nullptr)
-        switch_to_next(false);
+void greenthread_yield(void) {
+    if (current_thread != nullptr) switch_to_next(false);
 }
 
-void greenthread_block(void)
-{
+void greenthread_block(void) {
     Greenthread *self = current_thread;
-    if (self == nullptr)
-        return;
+    if (self == nullptr) return;
     /* The main context never blocks: it is the one that waits in the
      * selector, so for it blocking is just taking a turn. */
-    if (self != main_thread)
-        self->runnable = kBlocked;
+    if (self != main_thread) self->runnable = kBlocked;
     switch_to_next(false);
 }
 
-void greenthread_wakeup(Greenthread *thread)
-{
+void greenthread_wakeup(Greenthread *thread) {
     /* Null is what a selector callback holds when it was armed before
      * greenthreads_init: there is no thread to wake. Only a blocked thread
      * is queued; a finished one stays on the free list. */
-    if (thread == nullptr || thread->runnable != kBlocked)
-        return;
+    if (thread == nullptr || thread->runnable != kBlocked) return;
     thread->runnable = kRunnable;
     run_queue_append(thread);
 }
 
-Greenthread *current_greenthread(void)
-{
-    return current_thread;
-}
+Greenthread *current_greenthread(void) { return current_thread; }
 
-void greenthreads_run(void)
-{
-    while (live_threads != 0)
-        run_one_turn();
+void greenthreads_run(void) {
+    while (live_threads != 0) run_one_turn();
 }
 
 } // extern "C"

@@ -17,10 +17,7 @@ constexpr size_t kMaxTransfer = INT_MAX;
 
 /* True once the descriptor is ready; false (errno set) when the selector
  * refused the descriptor, so that nothing could ever wake the thread. */
-bool wait_until_ready(int fd, int events)
-{
-    return nb_poll(fd, events, 0) > 0;
-}
+bool wait_until_ready(int fd, int events) { return nb_poll(fd, events, 0) > 0; }
 
 bool would_block() { return errno == EAGAIN; }
 
@@ -28,27 +25,20 @@ bool would_block() { return errno == EAGAIN; }
 
 extern "C" {
 
-int nb_accept(int fd, struct sockaddr *addr, socklen_t *addrlen)
-{
+int nb_accept(int fd, struct sockaddr *addr, socklen_t *addrlen) {
     for (;;) {
         const int accepted = accept(fd, addr, addrlen);
-        if (accepted >= 0)
-            return accepted;
-        if (!would_block() || !wait_until_ready(fd, POLLIN))
-            return -1;
+        if (accepted >= 0) return accepted;
+        if (!would_block() || !wait_until_ready(fd, POLLIN)) return -1;
     }
 }
 
-int nb_connect(int fd, const struct sockaddr *addr, socklen_t addrlen)
-{
-    if (connect(fd, addr, addrlen) == 0)
-        return 0;
-    if (errno != EINPROGRESS || !wait_until_ready(fd, POLLOUT))
-        return -1;
+int nb_connect(int fd, const struct sockaddr *addr, socklen_t addrlen) {
+    if (connect(fd, addr, addrlen) == 0) return 0;
+    if (errno != EINPROGRESS || !wait_until_ready(fd, POLLOUT)) return -1;
     int error = 0;
     socklen_t length = sizeof error;
-    if (getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) != 0)
-        return -1;
+    if (getsockopt(fd, SOL_SOCKET, SO_ERROR, &error, &length) != 0) return -1;
     if (error != 0) {
         errno = error;
         return -1;
@@ -56,21 +46,16 @@ int nb_connect(int fd, const struct sockaddr *addr, socklen_t addrlen)
     return 0;
 }
 
-int nb_read(int fd, void *buf, size_t len)
-{
-    if (len > kMaxTransfer)
-        len = kMaxTransfer; /* a short read is always allowed */
+int nb_read(int fd, void *buf, size_t len) {
+    if (len > kMaxTransfer) len = kMaxTransfer; /* a short read is always allowed */
     for (;;) {
         const ssize_t count = read(fd, buf, len);
-        if (count >= 0)
-            return static_cast<int>(count);
-        if (!would_block() || !wait_until_ready(fd, POLLIN))
-            return -1;
+        if (count >= 0) return static_cast<int>(count);
+        if (!would_block() || !wait_until_ready(fd, POLLIN)) return -1;
     }
 }
 
-int nb_readall(int fd, void *buf, size_t len)
-{
+int nb_readall(int fd, void *buf, size_t len) {
     if (len > kMaxTransfer) {
         errno = EINVAL;
         return -1;
@@ -90,8 +75,7 @@ int nb_readall(int fd, void *buf, size_t len)
     return static_cast<int>(done);
 }
 
-int nb_write(int fd, const void *buf, size_t len)
-{
+int nb_write(int fd, const void *buf, size_t len) {
     if (len > kMaxTransfer) {
         errno = EINVAL;
         return -1;

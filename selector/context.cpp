@@ -19,8 +19,7 @@ constexpr int32_t kInitialTimerCapacity = 1;
 
 SelContext *allocate_context() {
     auto *ctx = static_cast<SelContext *>(malloc(sizeof(SelContext)));
-    if (ctx == nullptr)
-        return nullptr;
+    if (ctx == nullptr) return nullptr;
     memset(ctx, 0, sizeof *ctx);
     sigemptyset(&ctx->signals);
     FD_ZERO(&ctx->readSet);
@@ -43,8 +42,7 @@ SelContext *allocate_context() {
 extern "C" {
 
 void SelCreateKey(void) {
-    if (pthread_key_create(&sel_tl_key, SelFreeContext) != 0)
-        sel_tl_key = kNoKey;
+    if (pthread_key_create(&sel_tl_key, SelFreeContext) != 0) sel_tl_key = kNoKey;
 }
 
 void SelFreeContext(void *context) {
@@ -57,14 +55,11 @@ void SelFreeContext(void *context) {
 
 int SelInit(void) {
     pthread_once(&sel_tl_once, SelCreateKey);
-    if (sel_tl_key == kNoKey)
-        return -1;
-    if (SelCurrentContext() != nullptr)
-        return 0;
+    if (sel_tl_key == kNoKey) return -1;
+    if (SelCurrentContext() != nullptr) return 0;
 
     SelContext *ctx = allocate_context();
-    if (ctx == nullptr)
-        return -1;
+    if (ctx == nullptr) return -1;
     if (pthread_setspecific(sel_tl_key, ctx) != 0) {
         free(ctx->timerHeap);
         free(ctx);
@@ -94,8 +89,7 @@ int SelRemSignal(int signo) {
         errno = EINVAL;
         return -1;
     }
-    if (sigprocmask(SIG_UNBLOCK, &only, nullptr) != 0)
-        return -1;
+    if (sigprocmask(SIG_UNBLOCK, &only, nullptr) != 0) return -1;
 
     SelContext *ctx = SelCurrentContext();
     if (sigismember(&ctx->signals, signo) != 1 || sigdelset(&ctx->signals, signo) != 0) {

@@ -20,8 +20,7 @@ int thread_select_nb(void *hostContext) __attribute__((weak));
 int timeval_cmp(struct timeval a, struct timeval b) __attribute__((weak));
 struct timeval timeval_sub(struct timeval a, struct timeval b) __attribute__((weak));
 int pal_time_tzcurrent(struct timeval *now, void *unused) __attribute__((weak));
-int snmp_select_info(int *numfds, fd_set *fdset, struct timeval *timeout, int *block)
-    __attribute__((weak));
+int snmp_select_info(int *numfds, fd_set *fdset, struct timeval *timeout, int *block) __attribute__((weak));
 void snmp_read(fd_set *fdset) __attribute__((weak));
 void snmp_timeout(void) __attribute__((weak));
 void run_alarms(void) __attribute__((weak));
@@ -75,9 +74,7 @@ inline FdWord fd_word_mask_below(int i, int limit) {
 inline int highest_bit(FdWord bits) { return kFdWordBits - 1 - __builtin_clzl(bits); }
 inline int lowest_bit(FdWord bits) { return __builtin_ctzl(bits); }
 
-inline int clamp_to_set_size(int n) {
-    return n < 0 ? 0 : (n > kSelectSetSize ? kSelectSetSize : n);
-}
+inline int clamp_to_set_size(int n) { return n < 0 ? 0 : (n > kSelectSetSize ? kSelectSetSize : n); }
 
 } // namespace qorbu::sel
 

@@ -28,9 +28,7 @@ bool is_idle(const SelFdEntry &entry, const struct timeval &now) {
     return idle > kIdleLimitSec;
 }
 
-void schedule_reaper() {
-    SelMakeWhen(&fd_timer.when, kReaperPeriodSec, 0);
-}
+void schedule_reaper() { SelMakeWhen(&fd_timer.when, kReaperPeriodSec, 0); }
 
 } // namespace
 
@@ -38,8 +36,7 @@ namespace qorbu::sel {
 
 void arm_reaper_if_free(SelContext *ctx) {
     SelContext *expected = nullptr;
-    if (!reaper_owner.compare_exchange_strong(expected, ctx))
-        return;
+    if (!reaper_owner.compare_exchange_strong(expected, ctx)) return;
     fd_timer.heapIndex = 0;
     fd_timer.callback = SelReapIdleFDs;
     schedule_reaper();
@@ -47,8 +44,7 @@ void arm_reaper_if_free(SelContext *ctx) {
 }
 
 void release_reaper(SelContext *ctx) {
-    if (reaper_owner.load() != ctx)
-        return;
+    if (reaper_owner.load() != ctx) return;
     // The heap dies with the context; the record must not claim a slot in it.
     fd_timer.heapIndex = 0;
     reaper_owner.store(nullptr);
@@ -63,17 +59,14 @@ extern "C" int SelReapIdleFDs(SelTimer *) {
 
     int closed = 0;
     for (int fd = 0; fd < ctx->nfds; ++fd) {
-        if (!FD_ISSET(fd, &ctx->readSet))
-            continue;
+        if (!FD_ISSET(fd, &ctx->readSet)) continue;
         const SelFdEntry &entry = ctx->fdTable[fd];
-        if (entry.idleTracked == 0 || !is_idle(entry, now))
-            continue;
+        if (entry.idleTracked == 0 || !is_idle(entry, now)) continue;
         ++closed;
         SelRemFD(fd);
         close(fd);
     }
-    if (closed > kReaperExitThreshold)
-        exit(0);
+    if (closed > kReaperExitThreshold) exit(0);
 
     schedule_reaper();
     return SelAddTimer(&fd_timer);

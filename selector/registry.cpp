@@ -22,26 +22,19 @@ constexpr unsigned kRegistrableEvents = SEL_READ | SEL_WRITE | SEL_EXCEPT;
 constexpr size_t kMaxTableEntries = SIZE_MAX / sizeof(SelFdEntry);
 
 void stamp_activity(SelFdEntry *entry) {
-    if (entry->idleTracked == 1)
-        gettimeofday(&entry->lastActivity, nullptr);
+    if (entry->idleTracked == 1) gettimeofday(&entry->lastActivity, nullptr);
 }
 
 void set_interest(SelContext *ctx, int fd, unsigned events) {
-    if (events & SEL_READ)
-        FD_SET(fd, &ctx->readSet);
-    if (events & SEL_WRITE)
-        FD_SET(fd, &ctx->writeSet);
-    if (events & SEL_EXCEPT)
-        FD_SET(fd, &ctx->exceptSet);
+    if (events & SEL_READ) FD_SET(fd, &ctx->readSet);
+    if (events & SEL_WRITE) FD_SET(fd, &ctx->writeSet);
+    if (events & SEL_EXCEPT) FD_SET(fd, &ctx->exceptSet);
 }
 
 void clear_interest(SelContext *ctx, int fd, unsigned events) {
-    if (events & SEL_READ)
-        FD_CLR(fd, &ctx->readSet);
-    if (events & SEL_WRITE)
-        FD_CLR(fd, &ctx->writeSet);
-    if (events & SEL_EXCEPT)
-        FD_CLR(fd, &ctx->exceptSet);
+    if (events & SEL_READ) FD_CLR(fd, &ctx->readSet);
+    if (events & SEL_WRITE) FD_CLR(fd, &ctx->writeSet);
+    if (events & SEL_EXCEPT) FD_CLR(fd, &ctx->exceptSet);
 }
 
 void clear_everywhere(SelContext *ctx, int fd) {
@@ -54,8 +47,7 @@ void clear_everywhere(SelContext *ctx, int fd) {
 // nfds becomes one past the highest descriptor still registered, 1 when none is.
 void lower_nfds(SelContext *ctx, int fd) {
     int i = fd;
-    while (i > 0 && ctx->fdTable[i].events == 0)
-        --i;
+    while (i > 0 && ctx->fdTable[i].events == 0) --i;
     ctx->nfds = i + 1;
 }
 
@@ -65,11 +57,9 @@ bool is_open_descriptor(int fd) { return fcntl(fd, F_GETFD) != -1 || errno != EB
 // dispatched: they were meant for the registration just removed.
 void drop_pending_events(SelContext *ctx, int fd) {
     struct epoll_event *batch = ctx->epoll_batch;
-    if (batch == nullptr)
-        return;
+    if (batch == nullptr) return;
     for (int i = ctx->epoll_batch_next; i < ctx->epoll_batch_end; ++i)
-        if (batch[i].data.fd == fd)
-            batch[i].data.fd = -1;
+        if (batch[i].data.fd == fd) batch[i].data.fd = -1;
 }
 
 } // namespace
@@ -84,8 +74,7 @@ SelFdEntry *SelFdSlot(SelContext *ctx, int fd) {
             return nullptr;
         }
         auto *table = static_cast<SelFdEntry *>(realloc(ctx->fdTable, entries * sizeof(SelFdEntry)));
-        if (table == nullptr)
-            return nullptr;
+        if (table == nullptr) return nullptr;
         memset(table + ctx->fdTableSize, 0, (entries - ctx->fdTableSize) * sizeof(SelFdEntry));
         ctx->fdTable = table;
         ctx->fdTableSize = fd + 1;
@@ -109,8 +98,7 @@ int SelAddFD(int fd, unsigned int events, int idleTracked, SelFdCallback callbac
         return -1;
     }
     SelFdEntry *entry = SelFdSlot(ctx, fd);
-    if (entry == nullptr)
-        return -1;
+    if (entry == nullptr) return -1;
     if (entry->events != 0) {
         errno = EBUSY;
         return -1;
@@ -130,8 +118,7 @@ int SelAddFD(int fd, unsigned int events, int idleTracked, SelFdCallback callbac
     }
 
     set_interest(ctx, fd, events);
-    if (events != 0 && fd >= ctx->nfds)
-        ctx->nfds = fd + 1;
+    if (events != 0 && fd >= ctx->nfds) ctx->nfds = fd + 1;
     return 0;
 }
 
@@ -150,8 +137,7 @@ int SelRemFD(int fd) {
     // in the select-mode sets: the reaper and later select passes go by them.
     if (fd < ctx->nfds) {
         clear_everywhere(ctx, fd);
-        if (ctx->nfds == fd + 1)
-            lower_nfds(ctx, fd);
+        if (ctx->nfds == fd + 1) lower_nfds(ctx, fd);
     }
     if (epfd != 0) {
         drop_pending_events(ctx, fd);

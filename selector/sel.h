@@ -14,9 +14,9 @@
 extern "C" {
 #endif
 
-#define SEL_READ 1u
-#define SEL_WRITE 2u
-#define SEL_EXCEPT 4u
+#define SEL_READ        1u
+#define SEL_WRITE       2u
+#define SEL_EXCEPT      4u
 #define SEL_IN_CALLBACK 8u
 
 typedef struct SelTimer SelTimer;

@@ -21,19 +21,19 @@ struct epoll_event;
 /* One per selector thread. The field order is fixed: tools read it; fields
  * are only ever added at the end. */
 typedef struct SelContext {
-    sigset_t signals;   /* registered signals: blocked except while waiting */
-    fd_set readSet;     /* select-mode interest sets */
+    sigset_t signals; /* registered signals: blocked except while waiting */
+    fd_set readSet;   /* select-mode interest sets */
     fd_set writeSet;
     fd_set exceptSet;
-    int32_t nfds;       /* one past the highest select-mode registration */
-    int32_t scanStart;  /* where the next read/write scan begins */
+    int32_t nfds;      /* one past the highest select-mode registration */
+    int32_t scanStart; /* where the next read/write scan begins */
     SelFdEntry *fdTable;
     int32_t fdTableSize;
     SelTimer **timerHeap; /* slot 0: timer being fired; 1..timerCount: min-heap */
     int32_t timerCount;
     int32_t timerCapacity;
-    void *zg;           /* host context from SelSetZG */
-    fd_set readyRead;   /* working sets of the current wait */
+    void *zg;         /* host context from SelSetZG */
+    fd_set readyRead; /* working sets of the current wait */
     fd_set readyWrite;
     fd_set readyExcept;
     uint32_t pass_count; /* passes started in this thread, nested ones included */
@@ -71,9 +71,7 @@ static_assert(offsetof(SelContext, pass_count) == 928);
  * white-box tests (they link the static archive of the same objects). */
 /* The calling thread's context: every timer and descriptor call looks it up,
  * so the lookup is inline. */
-static inline SelContext *SelCurrentContext(void) {
-    return (SelContext *)pthread_getspecific(sel_tl_key);
-}
+static inline SelContext *SelCurrentContext(void) { return (SelContext *)pthread_getspecific(sel_tl_key); }
 void SelCreateKey(void);
 void SelFreeContext(void *context);
 

@@ -26,9 +26,12 @@ void report(fd_set *set, int fd, SelectWait *wait) {
 
 int select_collect_ready(int fd, unsigned int event, void *arg, SelFdEntry *) {
     auto *wait = static_cast<SelectWait *>(arg);
-    if (event == SEL_READ) report(wait->readfds, fd, wait);
-    else if (event == SEL_WRITE) report(wait->writefds, fd, wait);
-    else if (event == SEL_EXCEPT) report(wait->exceptfds, fd, wait);
+    if (event == SEL_READ)
+        report(wait->readfds, fd, wait);
+    else if (event == SEL_WRITE)
+        report(wait->writefds, fd, wait);
+    else if (event == SEL_EXCEPT)
+        report(wait->exceptfds, fd, wait);
     return 0;
 }
 

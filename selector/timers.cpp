@@ -40,10 +40,8 @@ bool grow_heap(SelContext *ctx) {
     }
     size_t slots = 2 * static_cast<size_t>(capacity) + 1;
     auto *heap = static_cast<SelTimer **>(realloc(ctx->timerHeap, slots * sizeof(SelTimer *)));
-    if (heap == nullptr)
-        return false;
-    for (size_t i = static_cast<size_t>(capacity) + 1; i < slots; ++i)
-        heap[i] = nullptr;
+    if (heap == nullptr) return false;
+    for (size_t i = static_cast<size_t>(capacity) + 1; i < slots; ++i) heap[i] = nullptr;
     ctx->timerHeap = heap;
     ctx->timerCapacity = 2 * capacity;
     return true;
@@ -54,8 +52,7 @@ int add_timer(SelContext *ctx, SelTimer *t) {
         kill(getpid(), SIGQUIT);
         return kTimerMisuse;
     }
-    if (ctx->timerCount == ctx->timerCapacity && !grow_heap(ctx))
-        return -1;
+    if (ctx->timerCount == ctx->timerCapacity && !grow_heap(ctx)) return -1;
     ctx->timerCount += 1;
     place(ctx, static_cast<uint32_t>(ctx->timerCount), t);
     SelHeapUp(ctx, static_cast<uint32_t>(ctx->timerCount));
@@ -64,10 +61,8 @@ int add_timer(SelContext *ctx, SelTimer *t) {
 
 void remove_timer(SelContext *ctx, SelTimer *t) {
     uint32_t i = t->heapIndex;
-    if (i == 0)
-        return;
-    if (!holds(ctx, t))
-        abort();
+    if (i == 0) return;
+    if (!holds(ctx, t)) abort();
     t->heapIndex = 0;
 
     uint32_t last = static_cast<uint32_t>(ctx->timerCount);
@@ -92,10 +87,8 @@ constexpr uint32_t kGrandchildren = 4;
 
 inline void prefetch_grandchildren(SelTimer *const *heap, uint32_t left, uint32_t count) {
     const uint32_t first = 2 * left;
-    if (first + kGrandchildren - 1 > count)
-        return;
-    for (uint32_t g = first; g < first + kGrandchildren; ++g)
-        __builtin_prefetch(&heap[g]->when);
+    if (first + kGrandchildren - 1 > count) return;
+    for (uint32_t g = first; g < first + kGrandchildren; ++g) __builtin_prefetch(&heap[g]->when);
 }
 
 bool is_due(const SelTimer *t, const struct timespec &now) { return !SelTimerBefore(&now, &t->when); }
@@ -104,10 +97,8 @@ bool is_due(const SelTimer *t, const struct timespec &now) { return !SelTimerBef
 // before the last callback serves as long as it already shows the timer due:
 // the monotonic clock never goes back. Only otherwise is the clock read again.
 bool due_by_clock(const SelTimer *t, struct timespec &now, bool &fresh) {
-    if (is_due(t, now))
-        return true;
-    if (fresh)
-        return false;
+    if (is_due(t, now)) return true;
+    if (fresh) return false;
     SelGetTime(&now);
     fresh = true;
     return is_due(t, now);
@@ -126,8 +117,7 @@ void SelHeapUp(SelContext *ctx, uint32_t slot) {
     SelTimer *t = heap[slot];
     while (slot > 1) {
         SelTimer *parent = heap[slot / 2];
-        if (!SelTimerBefore(&t->when, &parent->when))
-            break;
+        if (!SelTimerBefore(&t->when, &parent->when)) break;
         place(ctx, slot, parent);
         slot /= 2;
     }
@@ -140,16 +130,13 @@ void SelHeapDown(SelContext *ctx, uint32_t slot) {
     const uint32_t count = static_cast<uint32_t>(ctx->timerCount);
     for (;;) {
         uint32_t left = 2 * slot;
-        if (left > count)
-            break;
+        if (left > count) break;
         prefetch_grandchildren(heap, left, count);
         uint32_t right = left + 1;
         uint32_t child = left;
         // On equal deadlines the right child goes up.
-        if (right <= count && !SelTimerBefore(&heap[left]->when, &heap[right]->when))
-            child = right;
-        if (!SelTimerBefore(&heap[child]->when, &t->when))
-            break;
+        if (right <= count && !SelTimerBefore(&heap[left]->when, &heap[right]->when)) child = right;
+        if (!SelTimerBefore(&heap[child]->when, &t->when)) break;
         place(ctx, slot, heap[child]);
         slot = child;
     }
@@ -178,9 +165,9 @@ int SelMakeWhen(struct timespec *when, long sec, long nsec) {
         --carry;
     }
     long long seconds;
-    const bool overflow = __builtin_add_overflow(static_cast<long long>(when->tv_sec), static_cast<long long>(sec),
-                                                 &seconds) ||
-                          __builtin_add_overflow(seconds, carry, &seconds);
+    const bool overflow =
+        __builtin_add_overflow(static_cast<long long>(when->tv_sec), static_cast<long long>(sec), &seconds) ||
+        __builtin_add_overflow(seconds, carry, &seconds);
     constexpr time_t kLatest = std::numeric_limits<time_t>::max();
     constexpr time_t kEarliest = std::numeric_limits<time_t>::min();
     if (overflow ? sec > 0 : seconds > kLatest) {
@@ -204,8 +191,7 @@ int SelModifyTimer(SelTimer *t, const struct timespec *when) {
         t->when = *when;
         return add_timer(ctx, t);
     }
-    if (t->callback == nullptr || !holds(ctx, t))
-        abort();
+    if (t->callback == nullptr || !holds(ctx, t)) abort();
     bool later = SelTimerBefore(&t->when, when);
     t->when = *when;
     if (later)
@@ -228,8 +214,7 @@ int SelRemoveAllTimers(void) {
 int SelDebugIsTimerActive(SelTimer *t) {
     const SelContext *ctx = SelCurrentContext();
     for (int32_t i = 1; i <= ctx->timerCount; ++i)
-        if (ctx->timerHeap[i] == t)
-            return 1;
+        if (ctx->timerHeap[i] == t) return 1;
     return 0;
 }
 
@@ -247,15 +232,12 @@ int SelRunTimers(SelContext *ctx) {
     int fired = 0;
     for (;;) {
         SelTimer *top = ctx->timerHeap[1];
-        if (top == nullptr || !due_by_clock(top, now, fresh))
-            break;
+        if (top == nullptr || !due_by_clock(top, now, fresh)) break;
         ctx->timerHeap[0] = top;
         remove_timer(ctx, top);
         // The callback may re-arm, disarm or free the record, or grow the heap.
-        if (SelTimerCallback callback = top->callback)
-            callback(top);
-        if (++fired == kMaxTimersPerRun)
-            break;
+        if (SelTimerCallback callback = top->callback) callback(top);
+        if (++fired == kMaxTimersPerRun) break;
         fresh = false;
     }
     return fired;

@@ -65,15 +65,16 @@ void report_mismatch() {
 
 /* Where p goes in list k: the link to rewrite and the neighbours. */
 struct ListPosition {
-    uintptr_t *link;        // the link that leads to the lower neighbour
-    uintptr_t *upper_link;  // the link that leads to the upper neighbour
-    uintptr_t upper;        // 0 when none
-    uintptr_t lower;        // 0 when none
+    uintptr_t *link;       // the link that leads to the lower neighbour
+    uintptr_t *upper_link; // the link that leads to the upper neighbour
+    uintptr_t upper;       // 0 when none
+    uintptr_t lower;       // 0 when none
     bool damaged;
 };
 
 // Inlined: ShmFree's walk is on the hot path.
-[[gnu::always_inline]] inline ListPosition find_position(ShmHeader *h, int k, const ClassShape &shape, uintptr_t p) {
+[[gnu::always_inline]] inline ListPosition find_position(ShmHeader *h, int k, const ClassShape &shape,
+                                                         uintptr_t p) {
     ListCursor cursor(h, k, shape);
     uintptr_t *upper_link = nullptr;
     while (cursor.entry() > p) {

@@ -66,7 +66,8 @@ struct OpenRequest {
 bool valid_request(const OpenRequest &r) {
     if (r.mode != O_RDONLY && r.mode != O_RDWR) return false;
     if (r.addr % kAddressAlignment != 0) return false;
-    if (r.name == nullptr || r.name[0] == '\0' || strchr(r.name, '/') != nullptr || strchr(r.name, ':') != nullptr) {
+    if (r.name == nullptr || r.name[0] == '\0' || strchr(r.name, '/') != nullptr ||
+        strchr(r.name, ':') != nullptr) {
         return false;
     }
     if (r.intent != Intent::Create) return true;
@@ -304,9 +305,7 @@ QORBU_API int ShmUnlink(const char *name) {
     return result;
 }
 
-QORBU_API void *ShmAddr(ShmHandle *h) {
-    return reinterpret_cast<char *>(h->base) + page_size();
-}
+QORBU_API void *ShmAddr(ShmHandle *h) { return reinterpret_cast<char *>(h->base) + page_size(); }
 
 QORBU_API void *ShmMetadata(ShmHandle *h, uint32_t len) {
     if (len > page_size() - sizeof(ShmHeader)) {

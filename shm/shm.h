@@ -48,12 +48,12 @@ extern "C" {
 /* The header at the start of every segment; the data area starts one page
  * further. This is the format every process sharing a segment relies on. */
 typedef struct ShmHeader {
-    uintptr_t base;          /* address of this header in every process */
-    uint32_t size;           /* whole segment length; 0 until published */
-    pthread_mutex_t mutex;   /* process-shared, robust */
-    uint32_t useFlock;       /* 1 once a second read-write handle attached */
-    uint32_t busy;           /* 1 while an allocation or free changes the lists */
-    uintptr_t freeList[27];  /* heads, class k holds blocks of 8 << k bytes */
+    uintptr_t base;         /* address of this header in every process */
+    uint32_t size;          /* whole segment length; 0 until published */
+    pthread_mutex_t mutex;  /* process-shared, robust */
+    uint32_t useFlock;      /* 1 once a second read-write handle attached */
+    uint32_t busy;          /* 1 while an allocation or free changes the lists */
+    uintptr_t freeList[27]; /* heads, class k holds blocks of 8 << k bytes */
 } ShmHeader;
 
 struct ShmMapping;
@@ -62,11 +62,11 @@ struct ShmMapping;
  * ShmOpen and released by ShmClose. Callers may read the first three fields;
  * the rest belongs to the library. */
 typedef struct ShmHandle {
-    int fd;                      /* the object's descriptor; carries the descriptor lock */
-    ShmHeader *base;             /* the mapped header page */
-    uint32_t size;               /* length of the mapping: the whole segment */
-    uint32_t writable;           /* opened O_RDWR */
-    struct ShmMapping *mapping;  /* the process's one mapping of this segment */
+    int fd;                     /* the object's descriptor; carries the descriptor lock */
+    ShmHeader *base;            /* the mapped header page */
+    uint32_t size;              /* length of the mapping: the whole segment */
+    uint32_t writable;          /* opened O_RDWR */
+    struct ShmMapping *mapping; /* the process's one mapping of this segment */
 } ShmHandle;
 
 QORBU_API ShmHandle *ShmCreate(const char *name, void *addr, uint32_t size);

@@ -17,17 +17,17 @@ namespace qorbu::shm {
 constexpr int kClassCount = 27;
 constexpr int kLargestClass = kClassCount - 1;
 constexpr uintptr_t kSmallestBlock = 8;
-constexpr uintptr_t kAddressAlignment = 4096;  // data addresses given to ShmCreate
-constexpr uint32_t kAllocLimit = 0x40000000u;   // ShmAlloc refuses n at or above this
-constexpr int kPublishWaitMillis = 3000;        // an attach gives up on an unpublished segment after this
+constexpr uintptr_t kAddressAlignment = 4096; // data addresses given to ShmCreate
+constexpr uint32_t kAllocLimit = 0x40000000u; // ShmAlloc refuses n at or above this
+constexpr int kPublishWaitMillis = 3000;      // an attach gives up on an unpublished segment after this
 constexpr unsigned kPublishPollMicros = 10000;
-constexpr int kReadOnlyBusyPolls = 1000;        // a read-only attach waits this many ms for busy
+constexpr int kReadOnlyBusyPolls = 1000; // a read-only attach waits this many ms for busy
 constexpr unsigned kReadOnlyBusyPollMicros = 1000;
 constexpr uintptr_t kClassWordSize = sizeof(uintptr_t);
-constexpr int kWordShift = sizeof(uintptr_t) == 8 ? 3 : 2;  // log2 of sizeof(uintptr_t)
-constexpr int kDamaged = EUCLEAN;              // errno of an operation that met damaged lists
+constexpr int kWordShift = sizeof(uintptr_t) == 8 ? 3 : 2; // log2 of sizeof(uintptr_t)
+constexpr int kDamaged = EUCLEAN;                          // errno of an operation that met damaged lists
 
-constexpr int kSmallestShift = 3;  // log2 of kSmallestBlock
+constexpr int kSmallestShift = 3; // log2 of kSmallestBlock
 constexpr uintptr_t block_size(int k) { return kSmallestBlock << k; }
 static_assert(kSmallestBlock == uintptr_t{1} << kSmallestShift);
 static_assert(sizeof(uintptr_t) == uintptr_t{1} << kWordShift);
@@ -157,7 +157,7 @@ inline uintptr_t class_word_for(const ShmHeader *h, int k) {
 struct DataArea {
     uintptr_t start;
     uintptr_t length;
-    int page_shift;  // log2 of the page size
+    int page_shift; // log2 of the page size
 };
 inline DataArea data_area_of(const void *header, uint32_t mapping_length, uintptr_t page) {
     return {reinterpret_cast<uintptr_t>(header) + page, mapping_length - page, std::countr_zero(page)};
@@ -188,8 +188,8 @@ class ClassShape {
 
   private:
     uintptr_t start_;
-    int shift_;       // log2 of the alignment
-    uintptr_t step_;  // the block's size in slots, less one
+    int shift_;      // log2 of the alignment
+    uintptr_t step_; // the block's size in slots, less one
     uintptr_t top_;
 };
 
@@ -222,7 +222,8 @@ class ListCursor {
         if (slot < bound_) [[likely]] {
             entry_ = next;
             bound_ = slot;
-            if (shape_.spans_pages()) [[unlikely]] bound_ = shape_.below(slot);
+            if (shape_.spans_pages()) [[unlikely]]
+                bound_ = shape_.below(slot);
         } else {
             entry_ = 0;
             damaged_ = next != 0;
@@ -232,7 +233,7 @@ class ListCursor {
     uintptr_t *link_;
     uintptr_t entry_ = 0;
     ClassShape shape_;
-    uintptr_t bound_;  // the next entry's slot lies below this
+    uintptr_t bound_; // the next entry's slot lies below this
     bool damaged_ = false;
 };
 
@@ -258,7 +259,7 @@ struct ShmMapping {
     uint32_t length;
     bool writable;
     int handles;
-    int writers;  // read-write handles among them
+    int writers; // read-write handles among them
     ShmMapping *next;
     qorbu::shm::DataArea area;
     qorbu::shm::ClassShape shapes[qorbu::shm::kClassCount];

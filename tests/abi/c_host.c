@@ -10,12 +10,12 @@
 #include <selector/sel.h>
 #include <shm/shm.h>
 
-#define CHECK(cond)                                                     \
-    do {                                                                \
-        if (!(cond)) {                                                  \
-            fprintf(stderr, "%s:%d: check failed: %s\n", __FILE__, __LINE__, #cond); \
-            return 1;                                                   \
-        }                                                               \
+#define CHECK(cond)                                                                                          \
+    do {                                                                                                     \
+        if (!(cond)) {                                                                                       \
+            fprintf(stderr, "%s:%d: check failed: %s\n", __FILE__, __LINE__, #cond);                         \
+            return 1;                                                                                        \
+        }                                                                                                    \
     } while (0)
 
 static int fired;
@@ -34,7 +34,10 @@ static void green_entry(void *arg) {
 }
 
 static int on_readable(int fd, unsigned int event, void *arg, SelFdEntry *entry) {
-    (void)fd; (void)event; (void)arg; (void)entry;
+    (void)fd;
+    (void)event;
+    (void)arg;
+    (void)entry;
     return 0;
 }
 

@@ -17,17 +17,15 @@ std::vector<std::string> ran;
 void record(void *arg) { ran.emplace_back(static_cast<const char *>(arg)); }
 
 class HostSchedTest : public ::testing::Test {
-protected:
-    void SetUp() override
-    {
+  protected:
+    void SetUp() override {
         ran.clear();
         host_init(&host);
     }
     void TearDown() override { host_destroy(&host); }
 
     // What the select loop does at a drain: fetch and call until empty.
-    int drain()
-    {
+    int drain() {
         alignas(8) unsigned char task[SEL_HOST_TASK_SIZE];
         int count = 0;
         while (thread_fetch_queued(&host, task)) {
@@ -42,8 +40,7 @@ protected:
 
 timeval tv(long sec, long usec) { return timeval{sec, usec}; }
 
-TEST(HostClock, CompareSubtractAndAdd)
-{
+TEST(HostClock, CompareSubtractAndAdd) {
     EXPECT_LT(timeval_cmp(tv(1, 999999), tv(2, 0)), 0);
     EXPECT_GT(timeval_cmp(tv(2, 1), tv(2, 0)), 0);
     EXPECT_EQ(timeval_cmp(tv(5, 5), tv(5, 5)), 0);
@@ -66,22 +63,23 @@ TEST(HostClock, CompareSubtractAndAdd)
     EXPECT_LE(timeval_cmp(before, after), 0) << "the host clock must not go back";
 }
 
-TEST_F(HostSchedTest, QueueRunsTasksInOrderAndTasksMayPostMore)
-{
+TEST_F(HostSchedTest, QueueRunsTasksInOrderAndTasksMayPostMore) {
     alignas(8) unsigned char task[SEL_HOST_TASK_SIZE];
     EXPECT_EQ(thread_fetch_queued(&host, task), 0);
     host_post(&host, record, (void *)"a");
-    host_post(&host, [](void *arg) {
-        record((void *)"b");
-        host_post(static_cast<HostContext *>(arg), record, (void *)"c");
-    }, &host);
+    host_post(
+        &host,
+        [](void *arg) {
+            record((void *)"b");
+            host_post(static_cast<HostContext *>(arg), record, (void *)"c");
+        },
+        &host);
     EXPECT_EQ(drain(), 3);
     EXPECT_EQ(ran, (std::vector<std::string>{"a", "b", "c"}));
     EXPECT_EQ(drain(), 0);
 }
 
-TEST_F(HostSchedTest, TimedListsKeepEarliestFirstAndEqualTimesInArrivalOrder)
-{
+TEST_F(HostSchedTest, TimedListsKeepEarliestFirstAndEqualTimesInArrivalOrder) {
     host_after(&host, HOST_LIST_NORMAL, 60000, record, (void *)"late");
     host_after(&host, HOST_LIST_NORMAL, 30000, record, (void *)"early-1");
     host_after(&host, HOST_LIST_NORMAL, 30000, record, (void *)"early-2");
@@ -96,8 +94,7 @@ TEST_F(HostSchedTest, TimedListsKeepEarliestFirstAndEqualTimesInArrivalOrder)
     EXPECT_EQ(host_after(&host, HOST_LIST_COUNT, 0, record, nullptr), nullptr);
 }
 
-TEST_F(HostSchedTest, OnlyDueTasksAreQueuedListByList)
-{
+TEST_F(HostSchedTest, OnlyDueTasksAreQueuedListByList) {
     host_after(&host, HOST_LIST_IDLE, 0, record, (void *)"idle");
     host_after(&host, HOST_LIST_NORMAL, 60000, record, (void *)"not-yet");
     host_after(&host, HOST_LIST_URGENT, 0, record, (void *)"urgent");
@@ -108,8 +105,7 @@ TEST_F(HostSchedTest, OnlyDueTasksAreQueuedListByList)
     EXPECT_NE(host.scheduler.timed[HOST_LIST_NORMAL], nullptr);
 }
 
-TEST_F(HostSchedTest, CancelRemovesOnlyWaitingTasks)
-{
+TEST_F(HostSchedTest, CancelRemovesOnlyWaitingTasks) {
     HostTimed *keep = host_after(&host, HOST_LIST_LOW, 60000, record, (void *)"keep");
     HostTimed *drop = host_after(&host, HOST_LIST_LOW, 30000, record, (void *)"drop");
     EXPECT_EQ(host_cancel(&host, drop), 1);
@@ -119,8 +115,7 @@ TEST_F(HostSchedTest, CancelRemovesOnlyWaitingTasks)
     EXPECT_EQ(host_cancel(&host, &stranger), 0);
 }
 
-TEST_F(HostSchedTest, WatchedDescriptorQueuesItsTaskWhileReadable)
-{
+TEST_F(HostSchedTest, WatchedDescriptorQueuesItsTaskWhileReadable) {
     int fds[2];
     ASSERT_EQ(pipe2(fds, O_NONBLOCK), 0);
     EXPECT_EQ(host.scheduler.max_fd, -1);
@@ -142,22 +137,19 @@ TEST_F(HostSchedTest, WatchedDescriptorQueuesItsTaskWhileReadable)
 // host queued, and a due timed task or a readable host descriptor ends the
 // pass's wait.
 class HostSchedLoopTest : public HostSchedTest {
-protected:
-    void SetUp() override
-    {
+  protected:
+    void SetUp() override {
         HostSchedTest::SetUp();
         ASSERT_EQ(SelInit(), 0);
         SelSetZG(&host);
     }
-    void TearDown() override
-    {
+    void TearDown() override {
         SelSetZG(nullptr);
         HostSchedTest::TearDown();
     }
 };
 
-TEST_F(HostSchedLoopTest, PassRunsQueuedTasksBeforeItPolls)
-{
+TEST_F(HostSchedLoopTest, PassRunsQueuedTasksBeforeItPolls) {
     // A due timer keeps the pass from waiting: the queue must have been
     // drained at its start, before the timers ended it.
     SelTimer due{};
@@ -170,22 +162,19 @@ TEST_F(HostSchedLoopTest, PassRunsQueuedTasksBeforeItPolls)
     EXPECT_EQ(SelDebugIsTimerActive(&due), 0);
 }
 
-TEST_F(HostSchedLoopTest, TimedTaskEndsTheWaitWhenDue)
-{
+TEST_F(HostSchedLoopTest, TimedTaskEndsTheWaitWhenDue) {
     host_after(&host, HOST_LIST_LOW, 50, record, (void *)"timed");
     timespec start, now;
     SelGetTime(&start);
     // The reaper's timer is 30 s away: only the host's due time can end
     // these waits early.
-    for (int pass = 0; pass < 100 && ran.empty(); ++pass)
-        SelSelect();
+    for (int pass = 0; pass < 100 && ran.empty(); ++pass) SelSelect();
     SelGetTime(&now);
     EXPECT_EQ(ran, std::vector<std::string>{"timed"});
     EXPECT_LT(now.tv_sec - start.tv_sec, 20) << "the pass waited for the reaper, not the host task";
 }
 
-TEST_F(HostSchedLoopTest, ReadableHostDescriptorIsServicedAtTheEndOfThePass)
-{
+TEST_F(HostSchedLoopTest, ReadableHostDescriptorIsServicedAtTheEndOfThePass) {
     int fds[2];
     ASSERT_EQ(pipe2(fds, O_NONBLOCK), 0);
     host_watch_fd(&host, fds[0], record, (void *)"pipe");

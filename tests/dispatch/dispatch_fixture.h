@@ -27,12 +27,12 @@ namespace scripted {
 struct Host {
     SelHostScheduler scheduler{{}, {}, {}, -1, {}};
     SelHostContext context{&scheduler};
-    SelHostTask timedTasks[4];      /* storage for the first task of each timed list */
-    struct timeval now = {1000, 0}; /* the host clock, as pal_time_tzcurrent reports it */
-    std::deque<int> queue;          /* ids of the queued tasks */
+    SelHostTask timedTasks[4];        /* storage for the first task of each timed list */
+    struct timeval now = {1000, 0};   /* the host clock, as pal_time_tzcurrent reports it */
+    std::deque<int> queue;            /* ids of the queued tasks */
     std::function<void()> onSelectNb; /* run by thread_select_nb */
-    int snmpCount = 0;  /* what snmp_select_info reports as the count */
-    fd_set snmpSet{};   /* descriptors it adds to the caller's set */
+    int snmpCount = 0;                /* what snmp_select_info reports as the count */
+    fd_set snmpSet{};                 /* descriptors it adds to the caller's set */
     bool giveSnmpTimeout = false;
     struct timeval snmpTimeout = {0, 0};
     std::vector<std::string> log;
@@ -51,7 +51,9 @@ void reset();
 /* The first task of timed list i, due at the given host time. */
 void set_timed(int list, struct timeval when);
 void log(const std::string &entry);
-inline long times(const std::string &entry) { return std::count(host().log.begin(), host().log.end(), entry); }
+inline long times(const std::string &entry) {
+    return std::count(host().log.begin(), host().log.end(), entry);
+}
 
 } // namespace scripted
 
@@ -63,7 +65,10 @@ inline std::string cb(int fd, const char *event) { return "cb:" + std::to_string
 
 /* Logs "cb:<fd>:<r|w|x>" to the scripted host's log. */
 inline int log_callback(int fd, unsigned event, void *, SelFdEntry *) {
-    scripted::log(cb(fd, event == SEL_READ ? "r" : event == SEL_WRITE ? "w" : event == SEL_EXCEPT ? "x" : "?"));
+    scripted::log(cb(fd, event == SEL_READ     ? "r"
+                         : event == SEL_WRITE  ? "w"
+                         : event == SEL_EXCEPT ? "x"
+                                               : "?"));
     return 0;
 }
 
@@ -73,7 +78,9 @@ inline int log_timer(SelTimer *t) {
 }
 
 using Clock = std::chrono::steady_clock;
-inline double seconds_since(Clock::time_point start) { return std::chrono::duration<double>(Clock::now() - start).count(); }
+inline double seconds_since(Clock::time_point start) {
+    return std::chrono::duration<double>(Clock::now() - start).count();
+}
 
 inline volatile sig_atomic_t g_handled = 0;
 inline void count_signal(int) { g_handled = g_handled + 1; }
@@ -119,7 +126,7 @@ struct SocketPair {
 };
 
 class DispatchTest : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override {
         scripted::reset();
         ASSERT_EQ(SelInit(), 0);
@@ -129,7 +136,8 @@ protected:
 
     /* Host hooks on, with the scripted host's context. */
     static void use_host() { SelSetZG(&scripted::host().context); }
-    static int watch(int fd, unsigned events = SEL_READ, SelFdCallback callback = log_callback, void *arg = nullptr) {
+    static int watch(int fd, unsigned events = SEL_READ, SelFdCallback callback = log_callback,
+                     void *arg = nullptr) {
         return SelAddFD(fd, events, 0, callback, arg);
     }
     static void give_snmp_timeout(long sec, long usec) {
@@ -140,7 +148,8 @@ protected:
     static void clear_log() { scripted::host().log.clear(); }
     static Log callbacks_logged() {
         Log out;
-        std::copy_if(log().begin(), log().end(), std::back_inserter(out), [](auto &e) { return e.rfind("cb:", 0) == 0; });
+        std::copy_if(log().begin(), log().end(), std::back_inserter(out),
+                     [](auto &e) { return e.rfind("cb:", 0) == 0; });
         return out;
     }
     /* The pass would wait for the reaper's timer otherwise; a short timer

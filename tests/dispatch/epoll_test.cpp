@@ -26,7 +26,7 @@ int epoll_instances_open() {
 }
 
 class Epoll : public DispatchTest {
-protected:
+  protected:
     void SetUp() override {
         DispatchTest::SetUp();
         ASSERT_EQ(SelUseEpoll(), 0);
@@ -118,8 +118,7 @@ TEST_F(EpollInstance, ConcurrentSwitchesCreateOneInstance) {
     for (int i = 0; i < kThreads; ++i)
         threads.emplace_back([&, i] {
             ready.fetch_add(1);
-            while (ready.load() < kThreads) {
-            }
+            while (ready.load() < kThreads) {}
             EXPECT_EQ(SelUseEpoll(), 0);
             seen[i] = GetEpollFd();
         });
@@ -142,7 +141,8 @@ TEST_F(Epoll, EventsTranslateToOneSelectorBit) {
     dataThenHangUp.fill();
     close(dataThenHangUp.w);
     dataThenHangUp.w = -1;
-    EXPECT_EQ(single_pass(dataThenHangUp.r, SEL_READ), (Log{cb(dataThenHangUp.r, "r")})) << "EPOLLIN|EPOLLHUP";
+    EXPECT_EQ(single_pass(dataThenHangUp.r, SEL_READ), (Log{cb(dataThenHangUp.r, "r")}))
+        << "EPOLLIN|EPOLLHUP";
     close(broken.r);
     broken.r = -1;
     EXPECT_EQ(single_pass(broken.w, SEL_READ), (Log{cb(broken.w, "x")})) << "EPOLLERR alone";
@@ -277,7 +277,8 @@ TEST_F(Epoll, BlockingWaitTimeoutIsTruncatedToMilliseconds) {
     t.when = {100, 2500000};
     ASSERT_EQ(SelAddTimer(&t), 0);
     /* Plain, borrowing a second, under a millisecond, whole seconds. */
-    const std::pair<timespec, int> cases[] = {{{100, 0}, 2}, {{99, 999000000}, 3}, {{100, 1600000}, 0}, {{98, 0}, 2002}};
+    const std::pair<timespec, int> cases[] = {
+        {{100, 0}, 2}, {{99, 999000000}, 3}, {{100, 1600000}, 0}, {{98, 0}, 2002}};
     for (auto [now, ms] : cases)
         EXPECT_EQ(epoll_timeout_ms(ctx, now), ms) << now.tv_sec << "s " << now.tv_nsec << "ns";
     SelRemTimer(&t);

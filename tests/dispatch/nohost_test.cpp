@@ -14,8 +14,9 @@ int count_callback(int, unsigned, void *, SelFdEntry *) { return ++g_calls, 0; }
 int count_timer(SelTimer *) { return ++g_calls, 0; }
 
 TEST(NoHost, LoopAndSelectEmulationWorkWithoutHostOrSnmp) {
-    for (const char *name : {"thread_fetch_queued", "thread_call", "thread_select_nb", "timeval_cmp", "timeval_sub",
-                             "pal_time_tzcurrent", "snmp_select_info", "snmp_read", "snmp_timeout", "run_alarms"})
+    for (const char *name :
+         {"thread_fetch_queued", "thread_call", "thread_select_nb", "timeval_cmp", "timeval_sub",
+          "pal_time_tzcurrent", "snmp_select_info", "snmp_read", "snmp_timeout", "run_alarms"})
         ASSERT_EQ(dlsym(RTLD_DEFAULT, name), nullptr) << name << " is defined in this process";
     ASSERT_EQ(SelInit(), 0);
     int host[2], mine[2];

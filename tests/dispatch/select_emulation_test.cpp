@@ -17,7 +17,7 @@ fd_set set_of(std::initializer_list<int> fds) {
 }
 
 class ZarnSelect : public DispatchTest {
-protected:
+  protected:
     void SetUp() override {
         DispatchTest::SetUp();
         timersBefore = ctx->timerCount;
@@ -25,7 +25,8 @@ protected:
     /* Nothing of the call is left behind: no registration, no timer. */
     void expect_registry_clean() {
         for (int fd = 0; fd < FD_SETSIZE; ++fd)
-            ASSERT_FALSE(FD_ISSET(fd, &ctx->readSet) || FD_ISSET(fd, &ctx->writeSet) || FD_ISSET(fd, &ctx->exceptSet))
+            ASSERT_FALSE(FD_ISSET(fd, &ctx->readSet) || FD_ISSET(fd, &ctx->writeSet) ||
+                         FD_ISSET(fd, &ctx->exceptSet))
                 << "descriptor " << fd << " is still registered";
         EXPECT_EQ(ctx->timerCount, timersBefore);
     }
@@ -111,7 +112,8 @@ TEST_F(ZarnSelect, MicrosecondsCarryIntoSecondsAndFarTimeoutsSaturate) {
         EXPECT_LT(seconds_since(start), w.atLeast + 10.0);
         expect_registry_clean();
     }
-    for (struct timeval far : {timeval{LONG_MAX, 0}, timeval{LONG_MAX, 2500000}, timeval{LONG_MAX - 1, 999999}}) {
+    for (struct timeval far :
+         {timeval{LONG_MAX, 0}, timeval{LONG_MAX, 2500000}, timeval{LONG_MAX - 1, 999999}}) {
         arm_guard_timer(50);
         const long guardsBefore = scripted::times("timer:guard");
         EXPECT_EQ(zarn_select(0, nullptr, nullptr, nullptr, &far), 0) << far.tv_sec;

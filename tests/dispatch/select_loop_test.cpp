@@ -155,7 +155,8 @@ TEST_F(SelectPass, EarliestOfTimerAndSnmpTimeoutIsChosenAndANegativeOneIsZeroed)
         testing::internal::CaptureStderr();
         const auto start = Clock::now();
         EXPECT_EQ(SelSelect(), 0);
-        EXPECT_EQ(testing::internal::GetCapturedStderr(), snmp.tv_usec < 0 ? "tmeval in pselect -ve 0:-5000000\n" : "");
+        EXPECT_EQ(testing::internal::GetCapturedStderr(),
+                  snmp.tv_usec < 0 ? "tmeval in pselect -ve 0:-5000000\n" : "");
         EXPECT_LT(seconds_since(start), kGenerousLimit);
         EXPECT_EQ(log(), (Log{"snmp_info", "snmp_info", "snmp_timeout", "run_alarms"}));
     }
@@ -287,7 +288,8 @@ TEST_F(SelectDispatch, ReadScanIsRoundRobinAcrossPassesAndSpendingTheCountKeepsE
 }
 
 TEST_F(SelectDispatch, UrgentTcpDataFirstThenReadBeforeWrite) {
-    const int listener = socket(AF_INET, SOCK_STREAM, 0), client = socket(AF_INET, SOCK_STREAM, 0), server = 45;
+    const int listener = socket(AF_INET, SOCK_STREAM, 0), client = socket(AF_INET, SOCK_STREAM, 0),
+              server = 45;
     sockaddr_in addr{};
     addr.sin_family = AF_INET;
     addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
@@ -374,11 +376,12 @@ TEST_F(SelectFailures, ClosedDescriptorIsNamedWithItsCallbackThenAborts) {
     registered.r = hostOnly.r = -1;
     char callback[64];
     snprintf(callback, sizeof callback, "%p", reinterpret_cast<void *>(log_callback));
-    EXPECT_DEATH(SelSelect(), literal_regex(std::string("SelSelect(): [p]select() failed: Bad file descriptor\n"
-                                                        "SelSelect(): fd 40 (callback ") +
-                                            callback +
-                                            ") is invalid (probably close()ed)\n"
-                                            "SelSelect(): fd 50 (callback (nil)) is invalid (probably close()ed)\n"));
+    EXPECT_DEATH(SelSelect(),
+                 literal_regex(std::string("SelSelect(): [p]select() failed: Bad file descriptor\n"
+                                           "SelSelect(): fd 40 (callback ") +
+                               callback +
+                               ") is invalid (probably close()ed)\n"
+                               "SelSelect(): fd 50 (callback (nil)) is invalid (probably close()ed)\n"));
 }
 
 /* The wait never reaches past the 1024-bit working sets, whatever count the
@@ -392,7 +395,8 @@ TEST_F(SelectFailures, WaitWidthNeverExceedsTheSets) {
     ASSERT_EQ(watch(idle.r), 0);
     const struct {
         int snmpCount, maxFd, width;
-    } cases[] = {{2000, -1, 1024}, {FD_SETSIZE + 1, -1, 1024}, {0, INT_MAX, 61}, {0, 5000, 61}, {5000, INT_MAX, 1024}};
+    } cases[] = {
+        {2000, -1, 1024}, {FD_SETSIZE + 1, -1, 1024}, {0, INT_MAX, 61}, {0, 5000, 61}, {5000, INT_MAX, 1024}};
     for (const auto &c : cases) {
         host().snmpCount = c.snmpCount;
         host().scheduler.max_fd = c.maxFd;
@@ -447,14 +451,15 @@ TEST_F(SelectFailures, EinvalCountIsSharedByThreadsAndTheFifthFailureAborts) {
         EXPECT_EQ(errno, EINVAL);
         const std::string err = testing::internal::GetCapturedStderr();
         EXPECT_EQ(sel_einval_count.load(), failure);
-        EXPECT_EQ(err.rfind("SelSelect(): [p]select() failed: Invalid argument\n"
-                            "invalid params in select 41 tl fd 41 snmp fd 0 fdsetsize 1024 timeval 0:1500000000 \n"
-                            "selreadset 0 0\tselwriteset 0\tseloobset 0\n"
-                            "readset 0 0\twriteset 0\toobset 0\n"
-                            "selreadset 1 100\tselwriteset 0\tseloobset 0\n"
-                            "readset 1 100\twriteset 0\toobset 0\n",
-                            0),
-                  0u)
+        EXPECT_EQ(
+            err.rfind("SelSelect(): [p]select() failed: Invalid argument\n"
+                      "invalid params in select 41 tl fd 41 snmp fd 0 fdsetsize 1024 timeval 0:1500000000 \n"
+                      "selreadset 0 0\tselwriteset 0\tseloobset 0\n"
+                      "readset 0 0\twriteset 0\toobset 0\n"
+                      "selreadset 1 100\tselwriteset 0\tseloobset 0\n"
+                      "readset 1 100\twriteset 0\toobset 0\n",
+                      0),
+            0u)
             << err.substr(0, 300);
         EXPECT_EQ(std::count(err.begin(), err.end(), '\n'), 2 + 64);
     }

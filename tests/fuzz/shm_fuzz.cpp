@@ -73,7 +73,7 @@ std::string freeCatchingStderr(ShmHandle *h, void *p) {
 uint32_t requestSize(Input &in) {
     const uint8_t shape = in.byte();
     const uint32_t raw = in.word();
-    if (shape >= 250) return raw;  // anything, the refused sizes included
+    if (shape >= 250) return raw; // anything, the refused sizes included
     return raw & ((1u << (shape % 24)) - 1);
 }
 
@@ -143,18 +143,14 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
     while (!in.empty()) {
         switch (in.byte() % 5) {
         case 0:
-        case 1:
-            allocate(h, model, live, requestSize(in));
-            break;
+        case 1: allocate(h, model, live, requestSize(in)); break;
         case 2:
             if (!live.empty()) release(h, model, live, in.byte() % live.size());
             break;
         case 3:
             if (!live.empty()) freeInterior(h, live, in);
             break;
-        default:
-            countFree(h, model);
-            break;
+        default: countFree(h, model); break;
         }
         checkAgainstModel(h, model, live);
     }

@@ -9,12 +9,12 @@ namespace {
 
 char *stackBase;
 
-TEST(ExecutableStackProcess, GreenThreadStacksAreExecutableToo)
-{
+TEST(ExecutableStackProcess, GreenThreadStacksAreExecutableToo) {
     greenthreads_init();
     EXPECT_TRUE(process_wants_executable_stack());
-    greenthread_create([](void *) { stackBase = static_cast<char *>(current_greenthread()->context.uc_stack.ss_sp); },
-                       nullptr);
+    greenthread_create(
+        [](void *) { stackBase = static_cast<char *>(current_greenthread()->context.uc_stack.ss_sp); },
+        nullptr);
     greenthreads_run();
     ASSERT_NE(stackBase, nullptr);
     EXPECT_TRUE(is_inaccessible(mapping_at(stackBase)));

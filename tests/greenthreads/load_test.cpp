@@ -26,14 +26,12 @@ struct Connection {
 
 /* Echoed pieces are small and unacknowledged: without this, Nagle's
  * algorithm meets delayed acknowledgements and each message stalls. */
-void send_at_once(int fd)
-{
+void send_at_once(int fd) {
     const int on = 1;
     setsockopt(fd, IPPROTO_TCP, TCP_NODELAY, &on, sizeof on);
 }
 
-void echo_connection(void *arg)
-{
+void echo_connection(void *arg) {
     std::unique_ptr<Connection> conn(static_cast<Connection *>(arg));
     std::vector<unsigned char> buffer(kMaxMessage);
     set_nonblocking(conn->fd);
@@ -48,8 +46,7 @@ void echo_connection(void *arg)
     ++conn->server->connectionsDone;
 }
 
-void accept_connections(void *arg)
-{
+void accept_connections(void *arg) {
     auto *server = static_cast<EchoServer *>(arg);
     while (server->accepted < server->expected) {
         const int fd = nb_accept(server->listener, nullptr, nullptr);
@@ -58,8 +55,7 @@ void accept_connections(void *arg)
             return;
         }
         ++server->accepted;
-        if (greenthread_create(echo_connection, new Connection{server, fd}) == nullptr)
-            ++server->echoErrors;
+        if (greenthread_create(echo_connection, new Connection{server, fd}) == nullptr) ++server->echoErrors;
     }
 }
 
@@ -70,8 +66,7 @@ struct Client {
     int echoed = 0;  // messages that came back intact
     size_t bytes = 0;
     bool failed = false;
-    uint32_t next()
-    {
+    uint32_t next() {
         random ^= random << 13;
         random ^= random >> 17;
         random ^= random << 5;
@@ -79,17 +74,16 @@ struct Client {
     }
 };
 
-void run_client(void *arg)
-{
+void run_client(void *arg) {
     auto *client = static_cast<Client *>(arg);
     std::vector<unsigned char> out(kMaxMessage), in(kMaxMessage);
     const int fd = tcp_socket();
     send_at_once(fd);
-    client->failed = nb_connect(fd, reinterpret_cast<const sockaddr *>(client->address), sizeof *client->address) != 0;
+    client->failed =
+        nb_connect(fd, reinterpret_cast<const sockaddr *>(client->address), sizeof *client->address) != 0;
     for (int m = 0; m < client->messages && !client->failed; ++m) {
         const size_t size = 1 + client->next() % kMaxMessage;
-        for (size_t i = 0; i < size; ++i)
-            out[i] = static_cast<unsigned char>(client->next());
+        for (size_t i = 0; i < size; ++i) out[i] = static_cast<unsigned char>(client->next());
         client->failed = nb_write(fd, out.data(), size) != static_cast<int>(size) ||
                          nb_readall(fd, in.data(), size) != static_cast<int>(size) ||
                          memcmp(out.data(), in.data(), size) != 0;
@@ -101,8 +95,7 @@ void run_client(void *arg)
     close(fd);
 }
 
-void run_echo_load(int connections, int messages)
-{
+void run_echo_load(int connections, int messages) {
     Listener listener(4096);
     ASSERT_GE(listener.fd, 0);
     EchoServer server{listener.fd, connections};
@@ -135,13 +128,11 @@ void run_echo_load(int connections, int messages)
 
 using EchoLoad = GreenIo;
 
-TEST_F(EchoLoad, TwoHundredClientsFiftyMessagesEachInSelectMode)
-{
+TEST_F(EchoLoad, TwoHundredClientsFiftyMessagesEachInSelectMode) {
     run_echo_load(scaled(200, 100), scaled(50, 20));
 }
 
-TEST_F(EchoLoad, ThousandsOfConnectionsInEpollMode)
-{
+TEST_F(EchoLoad, ThousandsOfConnectionsInEpollMode) {
     const int connections = scaled(3000, 1100); // beyond the 1024 of select either way
     const rlim_t needed = 2 * static_cast<rlim_t>(connections) + 64;
     if (!raise_fd_limit(needed))

@@ -20,8 +20,7 @@ using NbCalls = GreenIo;
 
 int ignore_event(int, unsigned, void *, SelFdEntry *) { return 0; }
 
-TEST_F(NbCalls, ReadsWaitReturnShortCountsAndStopAtEndOfFile)
-{
+TEST_F(NbCalls, ReadsWaitReturnShortCountsAndStopAtEndOfFile) {
     SocketPair pair;
     char buf[100] = {};
     int readall = -2, written = -2, shortRead = 0, whole = 0, rest = 0;
@@ -63,8 +62,7 @@ TEST_F(NbCalls, ReadsWaitReturnShortCountsAndStopAtEndOfFile)
     SelRemFD(pair.fd[0]);
 }
 
-TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
-{
+TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes) {
     SocketPair pair;
     const int small = 4096;
     setsockopt(pair.fd[1], SOL_SOCKET, SO_SNDBUF, &small, sizeof small);
@@ -82,8 +80,7 @@ TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
     auto reader = [&] {
         while (received < total) {
             const int n = nb_read(pair.fd[0], in.data() + received, std::min<size_t>(4096, total - received));
-            if (n <= 0)
-                break;
+            if (n <= 0) break;
             received += static_cast<size_t>(n);
             greenthread_yield();
         }
@@ -97,8 +94,7 @@ TEST_F(NbCalls, WriteLargerThanTheSocketBufferWaitsAndCompletes)
     expect_nothing_left(pair.fd[1]);
 }
 
-TEST_F(NbCalls, AcceptAndConnectWaitForEachOtherAndARefusalIsReported)
-{
+TEST_F(NbCalls, AcceptAndConnectWaitForEachOtherAndARefusalIsReported) {
     Listener listener, bound(0, false); // bound, never listening: connections are refused
     ASSERT_GE(listener.fd, 0);
     ASSERT_GE(bound.fd, 0);
@@ -123,10 +119,8 @@ TEST_F(NbCalls, AcceptAndConnectWaitForEachOtherAndARefusalIsReported)
     EXPECT_EQ(connected, 0);
     EXPECT_EQ(received, 'k');
     EXPECT_EQ(refused, failure(ECONNREFUSED));
-    for (int fd : {listener.fd, client, refusedClient})
-        expect_nothing_left(fd);
-    for (int fd : {client, refusedClient, accepted})
-        close(fd);
+    for (int fd : {listener.fd, client, refusedClient}) expect_nothing_left(fd);
+    for (int fd : {client, refusedClient, accepted}) close(fd);
 }
 
 // EINTR ends a call at once. The descriptors are left blocking so that the
@@ -137,11 +131,9 @@ volatile sig_atomic_t signalsSeen;
 int rescueFd = -1;
 const sockaddr_in *rescueAddress;
 
-void rescue_after_first_signal(int)
-{
+void rescue_after_first_signal(int) {
     signalsSeen = signalsSeen + 1;
-    if (signalsSeen < 2)
-        return;
+    if (signalsSeen < 2) return;
     if (rescueAddress != nullptr) {
         const int fd = socket(AF_INET, SOCK_STREAM, 0);
         (void)connect(fd, reinterpret_cast<const sockaddr *>(rescueAddress), sizeof *rescueAddress);
@@ -151,8 +143,7 @@ void rescue_after_first_signal(int)
 }
 
 template <typename Call>
-void expect_eintr_without_retry(Call call)
-{
+void expect_eintr_without_retry(Call call) {
     struct sigaction action = {};
     action.sa_handler = rescue_after_first_signal; // no SA_RESTART: the system call fails with EINTR
     sigaction(SIGALRM, &action, nullptr);
@@ -166,8 +157,7 @@ void expect_eintr_without_retry(Call call)
     EXPECT_EQ(outcome, failure(EINTR));
 }
 
-TEST_F(NbCalls, ReadAndAcceptReturnEintrWithoutRetrying)
-{
+TEST_F(NbCalls, ReadAndAcceptReturnEintrWithoutRetrying) {
     int fds[2];
     ASSERT_EQ(pipe(fds), 0); // blocking
     rescueFd = fds[1];
@@ -186,8 +176,7 @@ TEST_F(NbCalls, ReadAndAcceptReturnEintrWithoutRetrying)
 
 // A descriptor the selector refuses makes every call fail with the
 // registration's errno instead of retrying for ever.
-TEST_F(NbCalls, RefusedRegistrationEndsEveryCallWithItsErrno)
-{
+TEST_F(NbCalls, RefusedRegistrationEndsEveryCallWithItsErrno) {
     SocketPair empty, full;
     Listener listener;
     ASSERT_GE(listener.fd, 0);
@@ -196,8 +185,7 @@ TEST_F(NbCalls, RefusedRegistrationEndsEveryCallWithItsErrno)
     while (write(full.fd[1], filler.data(), filler.size()) > 0) { // a write would now block
     }
     const int fds[] = {empty.fd[0], full.fd[1], listener.fd, client};
-    for (int fd : fds)
-        ASSERT_EQ(SelAddFD(fd, SEL_EXCEPT, 0, ignore_event, nullptr), 0);
+    for (int fd : fds) ASSERT_EQ(SelAddFD(fd, SEL_EXCEPT, 0, ignore_event, nullptr), 0);
 
     Outcome reading, readingAll, writing, accepting, connecting;
     char buf[8];
@@ -209,8 +197,7 @@ TEST_F(NbCalls, RefusedRegistrationEndsEveryCallWithItsErrno)
         connecting = with_errno(nb_connect(client, listener.address(), sizeof listener.addr));
     };
     run_threads(caller);
-    for (const Outcome &o : {reading, readingAll, writing, accepting})
-        EXPECT_EQ(o, failure(EBUSY));
+    for (const Outcome &o : {reading, readingAll, writing, accepting}) EXPECT_EQ(o, failure(EBUSY));
     if (connecting.first != 0) { // a loopback connection may be established at once, without a wait
         EXPECT_EQ(connecting, failure(EBUSY));
     }

@@ -11,8 +11,7 @@ namespace {
 
 using NbPoll = GreenIo;
 
-TEST_F(NbPoll, NeitherInNorOutSleepsOrFailsAndTimeoutsExpire)
-{
+TEST_F(NbPoll, NeitherInNorOutSleepsOrFailsAndTimeoutsExpire) {
     SocketPair pair;
     Outcome slept, refused, timedOut;
     double sleptFor = 0, waitedFor = 0;
@@ -37,20 +36,20 @@ TEST_F(NbPoll, NeitherInNorOutSleepsOrFailsAndTimeoutsExpire)
     expect_nothing_left(pair.fd[0]);
 }
 
-SelTimer *find_wait_timer()
-{
+SelTimer *find_wait_timer() {
     SelContext *ctx = SelCurrentContext();
     for (int i = 1; i <= ctx->timerCount; ++i)
-        if (ctx->timerHeap[i]->callback == nb_poll_on_timeout)
-            return ctx->timerHeap[i];
+        if (ctx->timerHeap[i]->callback == nb_poll_on_timeout) return ctx->timerHeap[i];
     return nullptr;
 }
 
-double seconds_of(const timespec &t) { return static_cast<double>(t.tv_sec) + static_cast<double>(t.tv_nsec) / 1e9; }
+double seconds_of(const timespec &t) {
+    return static_cast<double>(t.tv_sec) + static_cast<double>(t.tv_nsec) / 1e9;
+}
 
-TEST_F(NbPoll, WatchesInAndOutOnlyArmsAMonotonicTimeoutAndReadinessEndsTheWait)
-{
-    const std::pair<int, unsigned> cases[] = {{POLLIN | POLLPRI, SEL_READ}, {POLLIN | POLLOUT, SEL_READ | SEL_WRITE}};
+TEST_F(NbPoll, WatchesInAndOutOnlyArmsAMonotonicTimeoutAndReadinessEndsTheWait) {
+    const std::pair<int, unsigned> cases[] = {{POLLIN | POLLPRI, SEL_READ},
+                                              {POLLIN | POLLOUT, SEL_READ | SEL_WRITE}};
     for (const auto &[pollEvents, watched] : cases) {
         SCOPED_TRACE(pollEvents);
         SocketPair pair; // writable at once, readable once the inspector writes
@@ -84,15 +83,13 @@ TEST_F(NbPoll, WatchesInAndOutOnlyArmsAMonotonicTimeoutAndReadinessEndsTheWait)
     }
 }
 
-TEST_F(NbPoll, ReadinessWinsOverATimeoutDueInTheSamePass)
-{
+TEST_F(NbPoll, ReadinessWinsOverATimeoutDueInTheSamePass) {
     SocketPair pair;
     ASSERT_EQ(write(pair.fd[1], "x", 1), 1); // ready before the wait starts
     int result = 0;
     auto waiter = [&] { result = nb_poll(pair.fd[0], POLLIN, 1); };
     auto busy = [] { // keeps the selector away until the waiter's 1 ms time-out is due
-        for (const double until = seconds_now() + 0.030; seconds_now() < until;) {
-        }
+        for (const double until = seconds_now() + 0.030; seconds_now() < until;) {}
     };
     run_threads(waiter, busy);
     EXPECT_EQ(result, 1);
@@ -110,8 +107,7 @@ TEST_F(NbPoll, ReadinessWinsOverATimeoutDueInTheSamePass)
     EXPECT_EQ(wait.result, 1) << "a later time-out changes nothing";
 }
 
-TEST_F(NbPoll, WithoutTimeoutItWaitsWhileOtherThreadsRunOrRunsTheLoopInTheMainContext)
-{
+TEST_F(NbPoll, WithoutTimeoutItWaitsWhileOtherThreadsRunOrRunsTheLoopInTheMainContext) {
     SocketPair pair;
     std::string order;
     int result = 0, turns = 0;
@@ -142,8 +138,7 @@ TEST_F(NbPoll, WithoutTimeoutItWaitsWhileOtherThreadsRunOrRunsTheLoopInTheMainCo
     greenthreads_run();
 }
 
-TEST(NbPollWithoutScheduler, WaitsInTheSelectorAlone)
-{
+TEST(NbPollWithoutScheduler, WaitsInTheSelectorAlone) {
     ASSERT_EQ(SelInit(), 0);
     SocketPair pair;
     const double start = seconds_now();
@@ -159,8 +154,7 @@ TEST(NbPollWithoutScheduler, WaitsInTheSelectorAlone)
 
 int ignore_event(int, unsigned, void *, SelFdEntry *) { return 0; }
 
-TEST_F(NbPoll, InvalidOrBusyDescriptorFailsAtOnceAndKeepsTheOtherRegistration)
-{
+TEST_F(NbPoll, InvalidOrBusyDescriptorFailsAtOnceAndKeepsTheOtherRegistration) {
     SocketPair pair;
     int marker = 0;
     ASSERT_EQ(SelAddFD(pair.fd[0], SEL_READ, 0, ignore_event, &marker), 0);
@@ -177,8 +171,7 @@ TEST_F(NbPoll, InvalidOrBusyDescriptorFailsAtOnceAndKeepsTheOtherRegistration)
     SelRemFD(pair.fd[0]);
 }
 
-TEST_F(NbPoll, DescriptorBeyondTheSelectRangeFailsInSelectMode)
-{
+TEST_F(NbPoll, DescriptorBeyondTheSelectRangeFailsInSelectMode) {
     SKIP_UNLESS_FD_LIMIT(FD_SETSIZE + 16);
     SocketPair pair;
     const int high = dup2(pair.fd[0], FD_SETSIZE + 8);
@@ -192,8 +185,7 @@ TEST_F(NbPoll, DescriptorBeyondTheSelectRangeFailsInSelectMode)
 
 // In epoll mode the run loop waits with epoll: descriptors beyond the select
 // range work, and one that epoll refuses fails without leaving an entry.
-TEST_F(NbPoll, InEpollModeDescriptorsBeyondTheSelectRangeWorkAndRefusedOnesFail)
-{
+TEST_F(NbPoll, InEpollModeDescriptorsBeyondTheSelectRangeWorkAndRefusedOnesFail) {
     SKIP_UNLESS_FD_LIMIT(FD_SETSIZE + 16);
     ASSERT_EQ(SelUseEpoll(), 0);
     SocketPair pair;

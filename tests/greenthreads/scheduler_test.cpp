@@ -11,11 +11,9 @@ namespace {
 
 std::string trace;
 
-int queue_length()
-{
+int queue_length() {
     int n = 0;
-    for (Greenthread *t = run_queue_head; t != nullptr; t = t->next)
-        ++n;
+    for (Greenthread *t = run_queue_head; t != nullptr; t = t->next) ++n;
     return n;
 }
 
@@ -24,8 +22,7 @@ struct Yielder {
     int turns;
 };
 
-void yield_in_loop(void *arg)
-{
+void yield_in_loop(void *arg) {
     auto *self = static_cast<Yielder *>(arg);
     for (int i = 0; i < self->turns; ++i) {
         trace += self->name;
@@ -36,16 +33,14 @@ void yield_in_loop(void *arg)
 void do_nothing(void *) {}
 
 class Scheduler : public qorbu::test::GreenIo {
-protected:
-    void SetUp() override
-    {
+  protected:
+    void SetUp() override {
         trace.clear();
         GreenIo::SetUp();
     }
 };
 
-TEST_F(Scheduler, QueueIsFifoAndTheMainContextTakesOneTurnPerPass)
-{
+TEST_F(Scheduler, QueueIsFifoAndTheMainContextTakesOneTurnPerPass) {
     Yielder a{'A', 3}, b{'B', 3};
     greenthread_create(yield_in_loop, &a);
     greenthread_create(yield_in_loop, &b);
@@ -69,8 +64,7 @@ TEST_F(Scheduler, QueueIsFifoAndTheMainContextTakesOneTurnPerPass)
     EXPECT_EQ(trace, "1234");
 }
 
-TEST_F(Scheduler, FinishedRecordsAreReusedNewestFirstWithTheirStacks)
-{
+TEST_F(Scheduler, FinishedRecordsAreReusedNewestFirstWithTheirStacks) {
     static void *stackMark;
     auto markStack = [](void *arg) {
         stackMark = __builtin_frame_address(0);
@@ -112,8 +106,7 @@ TEST_F(Scheduler, FinishedRecordsAreReusedNewestFirstWithTheirStacks)
     EXPECT_EQ(live_threads, 0);
 }
 
-TEST_F(Scheduler, WakeupQueuesOnlyABlockedThreadAndOnlyOnce)
-{
+TEST_F(Scheduler, WakeupQueuesOnlyABlockedThreadAndOnlyOnce) {
     // Running, queued and main records are left as they are.
     static Greenthread *other;
     static int queuedAfterSelfWake, queuedAfterOtherWakes;
@@ -177,14 +170,12 @@ TEST_F(Scheduler, WakeupQueuesOnlyABlockedThreadAndOnlyOnce)
     EXPECT_EQ(live_threads, 0);
 }
 
-int count_pass(int, unsigned, void *arg, SelFdEntry *)
-{
+int count_pass(int, unsigned, void *arg, SelFdEntry *) {
     ++*static_cast<int *>(arg);
     return 0;
 }
 
-TEST_F(Scheduler, TheMainContextNeverBlocksAndRunWithoutThreadsSkipsTheSelector)
-{
+TEST_F(Scheduler, TheMainContextNeverBlocksAndRunWithoutThreadsSkipsTheSelector) {
     greenthread_yield(); // nothing queued: returns at once
     EXPECT_EQ(current_greenthread(), main_thread);
     EXPECT_EQ(run_queue_head, nullptr);
@@ -217,8 +208,7 @@ struct TimerWake {
     Greenthread *thread;
 };
 
-void block_until_timer(void *arg)
-{
+void block_until_timer(void *arg) {
     auto *wake = static_cast<TimerWake *>(arg);
     wake->timer.callback = [](SelTimer *timer) {
         greenthread_wakeup(static_cast<TimerWake *>(timer->arg)->thread);
@@ -233,8 +223,7 @@ void block_until_timer(void *arg)
 
 /* Every thread blocks: the run loop waits in the selector until the timer
  * wakes the last one, and returns once that one ends. */
-TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds)
-{
+TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds) {
     for (const bool epoll : {false, true}) {
         SCOPED_TRACE(epoll ? "epoll mode" : "select mode");
         if (epoll) {
@@ -258,8 +247,7 @@ TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds)
 
 /* Every green thread waits on a descriptor and no timer is armed: the run
  * loop sleeps in the kernel until the descriptor wakes it, in either mode. */
-TEST_F(Scheduler, AllWaitingWithoutATimerSleepsInTheKernel)
-{
+TEST_F(Scheduler, AllWaitingWithoutATimerSleepsInTheKernel) {
     for (const bool epoll : {false, true}) {
         SCOPED_TRACE(epoll ? "epoll mode" : "select mode");
         if (epoll) {
@@ -288,8 +276,7 @@ TEST_F(Scheduler, AllWaitingWithoutATimerSleepsInTheKernel)
     DeInitEpoll();
 }
 
-TEST(SchedulerUninitialised, CallsBeforeInitDoNothingHarmful)
-{
+TEST(SchedulerUninitialised, CallsBeforeInitDoNothingHarmful) {
     EXPECT_EQ(current_greenthread(), nullptr);
     EXPECT_EQ(greenthread_create(do_nothing, nullptr), nullptr);
     greenthread_yield();

@@ -26,15 +26,13 @@ char *stackBase;
 size_t stackLength;
 void *stackLocal;
 
-void note_stack(void *)
-{
+void note_stack(void *) {
     stackLocal = __builtin_frame_address(0);
     stackBase = static_cast<char *>(current_greenthread()->context.uc_stack.ss_sp);
     stackLength = current_greenthread()->context.uc_stack.ss_size;
 }
 
-TEST_F(Stack, SixteenKiBRoundedToPagesAboveAGuardPageWritableAndNotExecutable)
-{
+TEST_F(Stack, SixteenKiBRoundedToPagesAboveAGuardPageWritableAndNotExecutable) {
     EXPECT_EQ(stack_mapping_length(4096), 20480u);
     EXPECT_EQ(stack_mapping_length(8192), 24576u);
     EXPECT_EQ(stack_mapping_length(16384), 32768u);
@@ -55,20 +53,20 @@ TEST_F(Stack, SixteenKiBRoundedToPagesAboveAGuardPageWritableAndNotExecutable)
     EXPECT_EQ(mapping_at(stackBase + stackLength - 1).perms, "rw-p");
 }
 
-__attribute__((noinline)) int recurse(int depth)
-{
+__attribute__((noinline)) int recurse(int depth) {
     volatile char frame[128];
     frame[0] = static_cast<char>(depth);
-    if (depth > 100000000)
-        return frame[0];
+    if (depth > 100000000) return frame[0];
     return recurse(depth + 1) + frame[0];
 }
 
-TEST_F(Stack, TouchingTheGuardPageOrOverflowingEndsWithSigsegv)
-{
+TEST_F(Stack, TouchingTheGuardPageOrOverflowingEndsWithSigsegv) {
     EXPECT_SEGV_DEATH({
         greenthread_create(
-            [](void *) { static_cast<volatile char *>(current_greenthread()->context.uc_stack.ss_sp)[page_size - 1] = 1; },
+            [](void *) {
+                static_cast<volatile char *>(current_greenthread()->context.uc_stack.ss_sp)[page_size - 1] =
+                    1;
+            },
             nullptr);
         greenthreads_run();
     });
@@ -84,16 +82,14 @@ TEST_F(Stack, TouchingTheGuardPageOrOverflowingEndsWithSigsegv)
 constexpr size_t kLargeFrame = 3 * 4096;
 char *guardLow;
 
-__attribute__((noinline)) int large_frame()
-{
+__attribute__((noinline)) int large_frame() {
     volatile char frame[kLargeFrame];
     frame[0] = 1; // the lowest byte: three pages below the caller
     frame[kLargeFrame - 1] = 1;
     return frame[0] + frame[kLargeFrame - 1];
 }
 
-__attribute__((noinline)) void descend_then_call_large_frame()
-{
+__attribute__((noinline)) void descend_then_call_large_frame() {
     volatile char pad[64];
     pad[0] = 0;
     if (static_cast<char *>(__builtin_frame_address(0)) - (guardLow + page_size) > 1024)
@@ -103,18 +99,15 @@ __attribute__((noinline)) void descend_then_call_large_frame()
     pad[0] = pad[0] + 1; // keeps the call from becoming a jump
 }
 
-void on_segv(int, siginfo_t *info, void *)
-{
+void on_segv(int, siginfo_t *info, void *) {
     const char *fault = static_cast<const char *>(info->si_addr);
     if (fault < guardLow || fault >= guardLow + page_size)
-        _exit(3); // not the overflowing thread's guard page
+        _exit(3);             // not the overflowing thread's guard page
     signal(SIGSEGV, SIG_DFL); // the access faults again and ends the process
 }
 
-TEST_F(Stack, LargeFrameOverflowFaultsOnTheThreadsOwnGuardPage)
-{
-    if (page_size > 4096)
-        GTEST_SKIP() << "the frame is sized for 4 KiB pages";
+TEST_F(Stack, LargeFrameOverflowFaultsOnTheThreadsOwnGuardPage) {
+    if (page_size > 4096) GTEST_SKIP() << "the frame is sized for 4 KiB pages";
     EXPECT_EXIT(
         {
             static char altStack[64 * 1024];
@@ -126,8 +119,8 @@ TEST_F(Stack, LargeFrameOverflowFaultsOnTheThreadsOwnGuardPage)
             sa.sa_sigaction = on_segv;
             sa.sa_flags = SA_SIGINFO | SA_ONSTACK;
             sigaction(SIGSEGV, &sa, nullptr);
-            Greenthread *overflowing = greenthread_create(
-                [](void *) { descend_then_call_large_frame(); }, nullptr);
+            Greenthread *overflowing =
+                greenthread_create([](void *) { descend_then_call_large_frame(); }, nullptr);
             greenthread_create([](void *) {}, nullptr); // the neighbouring stack
             guardLow = static_cast<char *>(overflowing->context.uc_stack.ss_sp);
             greenthreads_run();
@@ -137,8 +130,7 @@ TEST_F(Stack, LargeFrameOverflowFaultsOnTheThreadsOwnGuardPage)
 }
 
 #if defined(__SANITIZE_ADDRESS__)
-__attribute__((noinline)) void overflow_a_local(void *)
-{
+__attribute__((noinline)) void overflow_a_local(void *) {
     char buffer[16];
     volatile char *const bytes = buffer; // no bounds known: AddressSanitizer's catch
     volatile int index = 16;
@@ -146,8 +138,7 @@ __attribute__((noinline)) void overflow_a_local(void *)
 }
 #endif
 
-TEST_F(Stack, AddressSanitizerReportsFaultsOnGreenThreadStacks)
-{
+TEST_F(Stack, AddressSanitizerReportsFaultsOnGreenThreadStacks) {
 #if defined(__SANITIZE_ADDRESS__)
     EXPECT_DEATH(
         {
@@ -164,25 +155,20 @@ TEST_F(Stack, AddressSanitizerReportsFaultsOnGreenThreadStacks)
 
 // Cuts the address space just above what is mapped now, so that the next
 // stack mapping fails.
-void limit_address_space()
-{
+void limit_address_space() {
     void *warm = malloc(64 * 1024); // the record's allocation still succeeds
     free(warm);
     FILE *statm = fopen("/proc/self/statm", "r");
     unsigned long pages = 0;
-    if (statm == nullptr || fscanf(statm, "%lu", &pages) != 1)
-        _exit(3);
+    if (statm == nullptr || fscanf(statm, "%lu", &pages) != 1) _exit(3);
     fclose(statm);
     struct rlimit limit;
     limit.rlim_cur = limit.rlim_max = pages * static_cast<unsigned long>(sysconf(_SC_PAGESIZE)) + 4096;
-    if (setrlimit(RLIMIT_AS, &limit) != 0)
-        _exit(4);
+    if (setrlimit(RLIMIT_AS, &limit) != 0) _exit(4);
 }
 
-TEST_F(Stack, UnmappableStackSendsSigsegvOrGivesNullWhenSigsegvIsIgnored)
-{
-    if (kEmulated || kSanitized)
-        GTEST_SKIP() << "qemu-user and sanitizer runtimes do not honour RLIMIT_AS";
+TEST_F(Stack, UnmappableStackSendsSigsegvOrGivesNullWhenSigsegvIsIgnored) {
+    if (kEmulated || kSanitized) GTEST_SKIP() << "qemu-user and sanitizer runtimes do not honour RLIMIT_AS";
     EXPECT_EXIT(
         {
             limit_address_space();

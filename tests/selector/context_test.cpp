@@ -21,8 +21,7 @@ bool blocked_in_thread(int signo) {
 
 bool fd_set_empty(const fd_set &set) {
     for (int fd = 0; fd < FD_SETSIZE; ++fd)
-        if (FD_ISSET(fd, &set))
-            return false;
+        if (FD_ISSET(fd, &set)) return false;
     return true;
 }
 
@@ -109,8 +108,7 @@ TEST_F(SelectorTest, InvalidSignalNumbersAreRefused) {
     }
     sigset_t empty;
     sigemptyset(&empty);
-    for (int signo = 1; signo <= 64; ++signo)
-        EXPECT_EQ(sigismember(&ctx->signals, signo), 0);
+    for (int signo = 1; signo <= 64; ++signo) EXPECT_EQ(sigismember(&ctx->signals, signo), 0);
 }
 
 namespace {
@@ -173,8 +171,7 @@ TEST(SelContextThreads, ReaperPassesToAnEarlierThreadAtItsNextPass) {
         }
         std::atomic<int> stage{0};
         auto await = [&stage](int s) {
-            while (stage.load() < s)
-                std::this_thread::yield();
+            while (stage.load() < s) std::this_thread::yield();
         };
         std::thread owner([&] {
             EXPECT_EQ(SelInit(), 0);
@@ -201,8 +198,7 @@ TEST(SelContextThreads, ReaperPassesToAnEarlierThreadAtItsNextPass) {
             });
         owner.join();
         stage = 4;
-        for (auto &t : others)
-            t.join();
+        for (auto &t : others) t.join();
         EXPECT_EQ(holds[0] + holds[1], 1) << "the reaper was taken over by exactly one thread";
     }
     DeInitEpoll();

@@ -25,7 +25,7 @@ std::vector<int> open_null(int count) {
 bool is_open(int fd) { return fcntl(fd, F_GETFD) != -1; }
 
 class ReaperTest : public SelectorTest {
-protected:
+  protected:
     // Bring the reaper's deadline to now instead of waiting 30 seconds.
     void run_reaper_now() {
         struct timespec now;
@@ -96,8 +96,7 @@ TEST_F(ReaperTest, EightHundredClosuresAreSurvived) {
         age(fd, 60);
     }
     run_reaper_now();
-    for (int fd : fds)
-        ASSERT_FALSE(is_open(fd));
+    for (int fd : fds) ASSERT_FALSE(is_open(fd));
     EXPECT_NE(fd_timer.heapIndex, 0u);
 }
 
@@ -107,8 +106,7 @@ TEST_F(ReaperTest, EightHundredClosuresAreSurvived) {
 // switch back finds nothing closed.
 TEST_F(ReaperTest, RemovedOrReapedDescriptorLeavesNoTraceInEitherMode) {
     std::vector<int> fds = open_null(2);
-    for (int fd : fds)
-        ASSERT_EQ(SelAddFD(fd, SEL_READ, 1, noop_fd_callback, nullptr), 0);
+    for (int fd : fds) ASSERT_EQ(SelAddFD(fd, SEL_READ, 1, noop_fd_callback, nullptr), 0);
     ASSERT_EQ(SelUseEpoll(), 0);
     EXPECT_EQ(SelRemFD(fds[0]), -1) << "never added to the epoll instance";
     close(fds[0]);
@@ -126,11 +124,9 @@ TEST_F(ReaperTest, RemovedOrReapedDescriptorLeavesNoTraceInEitherMode) {
         age(fd, 60);
     }
     run_reaper_now();
-    for (int fd : fds)
-        EXPECT_TRUE(is_open(fd)) << fd;
+    for (int fd : fds) EXPECT_TRUE(is_open(fd)) << fd;
 
-    for (int fd : fds)
-        close(fd);
+    for (int fd : fds) close(fd);
     DeInitEpoll();
     SelTimer due{};
     due.callback = qorbu::test::noop_timer_callback;

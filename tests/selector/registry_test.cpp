@@ -30,9 +30,12 @@ TEST_F(SelectorTest, AddRefusesBadArguments) {
         int fd;
         unsigned events;
         SelFdCallback callback;
-    } cases[] = {{5, SEL_IN_CALLBACK, noop_fd_callback}, {5, SEL_READ | 16u, noop_fd_callback},
-                 {-1, SEL_READ, noop_fd_callback},       {FD_SETSIZE, SEL_READ, noop_fd_callback},
-                 {5000, 0, noop_fd_callback},            {5, SEL_READ, nullptr}, // nothing to call
+    } cases[] = {{5, SEL_IN_CALLBACK, noop_fd_callback},
+                 {5, SEL_READ | 16u, noop_fd_callback},
+                 {-1, SEL_READ, noop_fd_callback},
+                 {FD_SETSIZE, SEL_READ, noop_fd_callback},
+                 {5000, 0, noop_fd_callback},
+                 {5, SEL_READ, nullptr}, // nothing to call
                  {5, 0, nullptr}};
     for (const Case &c : cases) {
         errno = 0;
@@ -101,8 +104,7 @@ TEST_F(SelectorTest, RemovedDescriptorKeepsItsLastArgument) {
 
 TEST_F(SelectorTest, TableGrowsAndKeepsEntries) {
     ASSERT_EQ(SelAddFD(2, SEL_READ, 0, noop_fd_callback, &tag_a), 0);
-    for (int fd = 10; fd < 1000; fd += 37)
-        ASSERT_EQ(SelAddFD(fd, SEL_WRITE, 0, noop_fd_callback, &tag_b), 0);
+    for (int fd = 10; fd < 1000; fd += 37) ASSERT_EQ(SelAddFD(fd, SEL_WRITE, 0, noop_fd_callback, &tag_b), 0);
     EXPECT_EQ(ctx->fdTableSize, 973); // 10 + 37 * 26 is the highest
     EXPECT_EQ(ctx->fdTable[2].arg, &tag_a);
     EXPECT_EQ(ctx->fdTable[2].events, SEL_READ);

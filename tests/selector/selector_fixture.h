@@ -9,7 +9,7 @@
 namespace qorbu::test {
 
 class SelectorTest : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override {
         ASSERT_EQ(SelInit(), 0);
         ctx = SelCurrentContext();

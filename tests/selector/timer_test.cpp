@@ -57,7 +57,7 @@ void expect_heap_consistent(const SelContext *ctx) {
 }
 
 class TimerHeapTest : public SelectorTest {
-protected:
+  protected:
     void SetUp() override {
         SelectorTest::SetUp();
         ASSERT_EQ(SelRemoveAllTimers(), 1); // the reaper
@@ -107,8 +107,8 @@ TEST(SelClock, MakeWhenCarriesIntoSeconds) {
             EXPECT_EQ(when.tv_nsec, c.saturated.tv_nsec) << c.sec;
             continue;
         }
-        long long delta =
-            (static_cast<long long>(when.tv_sec) - base.tv_sec) * 1000000000LL + (when.tv_nsec - base.tv_nsec);
+        long long delta = (static_cast<long long>(when.tv_sec) - base.tv_sec) * 1000000000LL +
+                          (when.tv_nsec - base.tv_nsec);
         EXPECT_GE(delta, c.minDelta) << c.sec << " " << c.nsec;
         EXPECT_LT(delta, c.maxDelta) << c.sec << " " << c.nsec;
     }
@@ -120,7 +120,9 @@ TEST_F(TimerHeapTest, SleepSetsMillisecondDeadline) {
     SelGetTime(&before);
     ASSERT_EQ(SelSleep(&t, 1500), 0);
     SelGetTime(&after);
-    auto ns = [](const struct timespec &v) { return static_cast<long long>(v.tv_sec) * 1000000000LL + v.tv_nsec; };
+    auto ns = [](const struct timespec &v) {
+        return static_cast<long long>(v.tv_sec) * 1000000000LL + v.tv_nsec;
+    };
     EXPECT_GE(ns(t.when) - ns(before), 1500000000LL);
     EXPECT_LE(ns(t.when) - ns(after), 1500000000LL);
     EXPECT_EQ(SelDebugIsTimerActive(&t), 1);
@@ -139,8 +141,7 @@ TEST_F(TimerHeapTest, CapacityDoubles) {
     EXPECT_EQ(SelRemoveAllTimers(), 5);
     EXPECT_EQ(SelRemoveAllTimers(), 0);
     EXPECT_EQ(ctx->timerCapacity, 8); // never shrinks
-    for (SelTimer &t : timers)
-        EXPECT_EQ(t.heapIndex, 0u);
+    for (SelTimer &t : timers) EXPECT_EQ(t.heapIndex, 0u);
 }
 
 TEST_F(TimerHeapTest, DebugIsActiveFindsEverySlot) {
@@ -151,8 +152,7 @@ TEST_F(TimerHeapTest, DebugIsActiveFindsEverySlot) {
         timers[i] = make_timer(at(i));
         ASSERT_EQ(SelAddTimer(&timers[i]), 0);
     }
-    for (SelTimer &t : timers)
-        EXPECT_EQ(SelDebugIsTimerActive(&t), 1);
+    for (SelTimer &t : timers) EXPECT_EQ(SelDebugIsTimerActive(&t), 1);
     EXPECT_EQ(SelDebugIsTimerActive(&unarmed), 0);
 }
 
@@ -162,7 +162,9 @@ TEST_F(TimerHeapTest, RandomOperationsKeepDeadlineOrder) {
     constexpr int kTimers = 300;
     std::vector<SelTimer> timers(kTimers);
     std::multimap<std::pair<long, long>, SelTimer *> reference;
-    auto key = [](const SelTimer &t) { return std::make_pair(static_cast<long>(t.when.tv_sec), t.when.tv_nsec); };
+    auto key = [](const SelTimer &t) {
+        return std::make_pair(static_cast<long>(t.when.tv_sec), t.when.tv_nsec);
+    };
     auto erase_ref = [&](SelTimer *t) {
         auto range = reference.equal_range(key(*t));
         for (auto it = range.first; it != range.second; ++it)
@@ -172,8 +174,7 @@ TEST_F(TimerHeapTest, RandomOperationsKeepDeadlineOrder) {
             }
         FAIL() << "timer missing from reference";
     };
-    for (SelTimer &t : timers)
-        t = make_timer(at(0));
+    for (SelTimer &t : timers) t = make_timer(at(0));
 
     for (int step = 0; step < 20000; ++step) {
         SelTimer *t = &timers[rng() % kTimers];
@@ -188,21 +189,18 @@ TEST_F(TimerHeapTest, RandomOperationsKeepDeadlineOrder) {
             }
             break;
         case 1:
-            if (t->heapIndex != 0)
-                erase_ref(t);
+            if (t->heapIndex != 0) erase_ref(t);
             ASSERT_EQ(SelModifyTimer(t, &when), 0);
             reference.emplace(key(*t), t);
             break;
         default:
-            if (t->heapIndex != 0)
-                erase_ref(t);
+            if (t->heapIndex != 0) erase_ref(t);
             SelRemTimer(t);
             ASSERT_EQ(t->heapIndex, 0u);
             break;
         }
         ASSERT_EQ(ctx->timerCount, static_cast<int32_t>(reference.size()));
-        if (step % 97 == 0)
-            expect_heap_consistent(ctx);
+        if (step % 97 == 0) expect_heap_consistent(ctx);
     }
     expect_heap_consistent(ctx);
     // Draining from the top yields the reference order (ties in any order).
@@ -285,8 +283,7 @@ int free_self(SelTimer *t) {
 
 std::vector<SelTimer> *grown = nullptr;
 int arm_many(SelTimer *) {
-    for (SelTimer &t : *grown)
-        EXPECT_EQ(SelAddTimer(&t), 0);
+    for (SelTimer &t : *grown) EXPECT_EQ(SelAddTimer(&t), 0);
     return 0;
 }
 
@@ -313,8 +310,7 @@ TEST_F(TimerHeapTest, CallbacksMayDisarmFreeOrGrow) {
     grown = &many;
     SelTimer grower = make_timer(now_plus(-1, 100), arm_many);
 
-    for (SelTimer *t : {&later, &first, owned, &grower})
-        ASSERT_EQ(SelAddTimer(t), 0);
+    for (SelTimer *t : {&later, &first, owned, &grower}) ASSERT_EQ(SelAddTimer(t), 0);
     // first disarms later before it is due; owned frees itself; grower grows the heap.
     EXPECT_EQ(SelRunTimers(ctx), 3);
     EXPECT_EQ(fire_count, 1);

@@ -95,7 +95,8 @@ void runSequence(uint32_t dataBytes, unsigned seed, int operations, bool placedB
         if (live.empty() || std::uniform_int_distribution<int>(0, 99)(rng) < 55) {
             // Log-uniform sizes: as many tiny as large requests.
             const int bits = std::uniform_int_distribution<int>(0, 31 - __builtin_clz(dataBytes))(rng);
-            const uint32_t n = std::uniform_int_distribution<uint32_t>(0, (2u << bits) - 1)(rng) % (dataBytes + 1);
+            const uint32_t n =
+                std::uniform_int_distribution<uint32_t>(0, (2u << bits) - 1)(rng) % (dataBytes + 1);
             const uintptr_t expected = model.alloc(n);
             errno = 0;
             const uintptr_t got = reinterpret_cast<uintptr_t>(ShmAlloc(h, n));
@@ -149,10 +150,14 @@ TEST_F(ExampleSegment, LayoutAndDump) {
     EXPECT_EQ(dumped, expectedDump(fresh()));
     EXPECT_EQ(dumped.substr(0, 21), "0x00000008 [0] = { }\n");
     EXPECT_NE(dumped.find("\n0x20000000 [26] = { }\n"), std::string::npos);
-    if (H == 0x40000000u) { EXPECT_NE(dumped.find("\n0x00001000 [9] = { 0x40005000 }\n"), std::string::npos); }
+    if (H == 0x40000000u) {
+        EXPECT_NE(dumped.find("\n0x00001000 [9] = { 0x40005000 }\n"), std::string::npos);
+    }
 
     const uint32_t metadataRoom = uint32_t(4096 - sizeof(ShmHeader));
-    if (sizeof(uintptr_t) == 4) { EXPECT_EQ(metadataRoom, 3948u); }
+    if (sizeof(uintptr_t) == 4) {
+        EXPECT_EQ(metadataRoom, 3948u);
+    }
     EXPECT_EQ(reinterpret_cast<uintptr_t>(ShmMetadata(h, metadataRoom)), H + sizeof(ShmHeader));
     EXPECT_REFUSED(ENOMEM, ShmMetadata(h, metadataRoom + 1));
     ShmClose(h);
@@ -164,15 +169,23 @@ TEST_F(ExampleSegment, SplitsTheHighestBlockMergesBackAndRefusesWhenExhausted) {
     void *p = ShmAlloc(h, 100);
     const uintptr_t b = reinterpret_cast<uintptr_t>(p);
     EXPECT_EQ(b, H + 0x5000);
-    expectLists({{4, {H + 0x5080}}, {5, {H + 0x5100}}, {6, {H + 0x5200}}, {7, {H + 0x5400}}, {8, {H + 0x5800}},
+    expectLists({{4, {H + 0x5080}},
+                 {5, {H + 0x5100}},
+                 {6, {H + 0x5200}},
+                 {7, {H + 0x5400}},
+                 {8, {H + 0x5800}},
                  {11, {H + 0x1000}}});
     EXPECT_EQ(classWordAt(b), slotAddress(h->base, 4));
-    if (sizeof(uintptr_t) == 4) { EXPECT_EQ(classWordAt(b), H + 0x38) << "class word at " << hex(b - 4); }
+    if (sizeof(uintptr_t) == 4) {
+        EXPECT_EQ(classWordAt(b), H + 0x38) << "class word at " << hex(b - 4);
+    }
     EXPECT_EQ(ShmTotalFree(h), 20352u);
     ShmFree(h, p);
     expectFresh();
     EXPECT_EQ(classWordAt(b), slotAddress(h->base, 9));
-    if (sizeof(uintptr_t) == 4) { EXPECT_EQ(classWordAt(b), H + 0x4C); }
+    if (sizeof(uintptr_t) == 4) {
+        EXPECT_EQ(classWordAt(b), H + 0x4C);
+    }
 
     void *big = ShmAlloc(h, 10000);
     ASSERT_EQ(reinterpret_cast<uintptr_t>(big), H + 0x1000);
@@ -204,7 +217,8 @@ TEST(ShmAlloc, SizeClassesAndOversizedRequestsRefusedBeforeTheLock) {
         void *p = ShmAlloc(h, n);
         EXPECT_NE(p, nullptr) << n;
         if (p == nullptr) return -1;
-        const int k = int((classWordAt(reinterpret_cast<uintptr_t>(p)) - slotAddress(h->base, 0)) / sizeof(uintptr_t));
+        const int k =
+            int((classWordAt(reinterpret_cast<uintptr_t>(p)) - slotAddress(h->base, 0)) / sizeof(uintptr_t));
         ShmFree(h, p);
         return k;
     };
@@ -272,7 +286,8 @@ TEST(ShmFree, NullAndForeignPointersChangeNothing) {
         errno = 4321;
         ShmFree(mine, c.p);
         EXPECT_EQ(errno, 4321) << c.what;
-        EXPECT_EQ(testing::internal::GetCapturedStderr(), "ShmFree(): mismatched handle and pointer\n") << c.what;
+        EXPECT_EQ(testing::internal::GetCapturedStderr(), "ShmFree(): mismatched handle and pointer\n")
+            << c.what;
         EXPECT_TRUE(lists.unchanged()) << c.what;
         EXPECT_EQ(mine->base->busy, 0u) << c.what;
     }
@@ -397,7 +412,7 @@ TEST(ShmDamage, DamagedListsAreReportedNeverFollowed) {
         const char *what;
         uintptr_t *word;
         uintptr_t value;
-        bool walksOnly = false;  // list 11, which only the whole-segment walks visit
+        bool walksOnly = false; // list 11, which only the whole-segment walks visit
     } cases[] = {
         {"head in the header page", head, reinterpret_cast<uintptr_t>(h->base) + 64},
         {"head not aligned to its class", head, data + 0x3000 + 8},

@@ -55,8 +55,9 @@ int worker(const char *name, unsigned seed, int operations) {
     return kOk;
 }
 
-void runWorkers(const char *name, int count, unsigned seed, int operations,
-                const std::function<void()> &meanwhile = [] {}) {
+void runWorkers(
+    const char *name, int count, unsigned seed, int operations,
+    const std::function<void()> &meanwhile = [] {}) {
     std::vector<pid_t> pids;
     for (int i = 0; i < count; i++) {
         pids.push_back(startChild([=] { return worker(name, seed + i, operations); }, kChildSeconds));
@@ -142,14 +143,15 @@ TEST(ShmCrash, HolderKilledInsideAnOperationLeavesTheSegmentRefusingNotHanging) 
 
     // Every process now refuses at once (the alarm ends a hung child).
     EXPECT_EQ(runInChild(
-        [&] {
-            errno = 0;
-            if (ShmAlloc(h, 8) != nullptr || errno != EBUSY) return 1;
-            ShmFree(h, kept);
-            if (errno != EBUSY || ShmTotalFree(h) != 0 || errno != EBUSY) return 2;
-            return ShmOpen(name.c_str(), O_RDWR) == nullptr && errno == EBUSY ? 0 : 3;
-        },
-        60), 0);
+                  [&] {
+                      errno = 0;
+                      if (ShmAlloc(h, 8) != nullptr || errno != EBUSY) return 1;
+                      ShmFree(h, kept);
+                      if (errno != EBUSY || ShmTotalFree(h) != 0 || errno != EBUSY) return 2;
+                      return ShmOpen(name.c_str(), O_RDWR) == nullptr && errno == EBUSY ? 0 : 3;
+                  },
+                  60),
+              0);
     EXPECT_REFUSED(EBUSY, ShmAlloc(h, 8));
     EXPECT_TRUE(lists.unchanged()) << "a block was lost";
     ShmClose(h);

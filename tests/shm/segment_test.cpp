@@ -52,8 +52,9 @@ TEST(ShmValidation, BadArgumentsRefusedAndSmallSizesRoundedToTwoPages) {
     ShmClose(nullptr);
     EXPECT_REFUSED(EINVAL, ShmCreate(n, nullptr, 0));
     EXPECT_REFUSED(EINVAL, ShmCreate(n, nullptr, UINT32_MAX));
-    EXPECT_REFUSED(EINVAL, ShmCreate(n, nullptr, UINT32_MAX - 2 * uint32_t(pageBytes()) + 2)); // first to wrap
-    if (pageBytes() == 4096) EXPECT_REFUSED(EINVAL, ShmCreate(n, (void *)0x1000, 1)); // header at 0
+    EXPECT_REFUSED(EINVAL,
+                   ShmCreate(n, nullptr, UINT32_MAX - 2 * uint32_t(pageBytes()) + 2)); // first to wrap
+    if (pageBytes() == 4096) EXPECT_REFUSED(EINVAL, ShmCreate(n, (void *)0x1000, 1));  // header at 0
     EXPECT_EQ(openDescriptorCount(), fds);
     EXPECT_REFUSED(ENOENT, ShmOpen(n, O_RDONLY)); // no refused create made the object
     EXPECT_ERRNO(ENOENT, EXPECT_EQ(ShmUnlink(n), -1));
@@ -78,8 +79,10 @@ TEST(ShmValidation, UntrustworthyHeadersFailWithEinvalAndAcquireNothing) {
         uintptr_t base;
         uint32_t size;
     } cases[] = {
-        {"base not page-aligned", header + 8, uint32_t(3 * page)}, {"base 0", 0, uint32_t(3 * page)},
-        {"size not a page multiple", header, uint32_t(3 * page + 8)}, {"a single page", header, uint32_t(page)},
+        {"base not page-aligned", header + 8, uint32_t(3 * page)},
+        {"base 0", 0, uint32_t(3 * page)},
+        {"size not a page multiple", header, uint32_t(3 * page + 8)},
+        {"a single page", header, uint32_t(page)},
         {"larger than the object", header, uint32_t(4 * page)},
     };
     for (const auto &c : cases) {
@@ -169,8 +172,9 @@ TEST(ShmSegment, AttachesOnlyAtTheRecordedBaseAndNeverOverMemoryInUse) {
     ASSERT_TRUE(rangeIsFree(H, 9 * page));
 
     // Something else of this process now lives where the segment was.
-    auto *mine = static_cast<unsigned char *>(
-        mmap(reinterpret_cast<void *>(H + page), page, PROT_READ | PROT_WRITE, MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
+    auto *mine =
+        static_cast<unsigned char *>(mmap(reinterpret_cast<void *>(H + page), page, PROT_READ | PROT_WRITE,
+                                          MAP_PRIVATE | MAP_ANONYMOUS, -1, 0));
     ASSERT_EQ(reinterpret_cast<uintptr_t>(mine), H + page) << "hint not honoured here";
     memset(mine, 0x5a, page);
     const int fds = openDescriptorCount();
@@ -243,7 +247,8 @@ TEST(ShmPublication, HalfMadeAndJunkObjectsAreGivenUpOn) {
         const char *what;
         off_t length;
         int err;
-    } objects[] = {{"never sized", 0, ETIMEDOUT}, {"sized, never published", 3 * page, ETIMEDOUT},
+    } objects[] = {{"never sized", 0, ETIMEDOUT},
+                   {"sized, never published", 3 * page, ETIMEDOUT},
                    {"100 bytes of junk", 100, EINVAL}};
     std::vector<NameGuard> names;
     names.reserve(std::size(objects)); // a NameGuard unlinks its name when it goes
@@ -265,10 +270,12 @@ TEST(ShmPublication, HalfMadeAndJunkObjectsAreGivenUpOn) {
                     const int fds = openDescriptorCount();
                     const auto start = Clock::now();
                     errno = 0;
-                    ShmHandle *h = call == 0 ? ShmOpen(name, O_RDONLY)
-                                   : call == 1 ? ShmOpen(name, O_RDWR) : ShmCreate(name, nullptr, 4096);
+                    ShmHandle *h = call == 0   ? ShmOpen(name, O_RDONLY)
+                                   : call == 1 ? ShmOpen(name, O_RDWR)
+                                               : ShmCreate(name, nullptr, 4096);
                     const int err = errno;
-                    const auto waited = std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - start);
+                    const auto waited =
+                        std::chrono::duration_cast<std::chrono::milliseconds>(Clock::now() - start);
                     if (h != nullptr || err != o.err) return 1;
                     if (openDescriptorCount() != fds) return 2;
                     if (o.err == ETIMEDOUT && waited.count() < qorbu::shm::kPublishWaitMillis) return 3;
@@ -308,7 +315,8 @@ TEST(ShmPublication, CreatorsRacingOnOneNameInitialiseItOnce) {
                     char c;
                     if (read(go[0], &c, 1) != 0) return 1; // all start at the end of the pipe
                     ShmHandle *h = ShmCreate(name.c_str(), nullptr, 1u << 16);
-                    const auto block = reinterpret_cast<uintptr_t>(h != nullptr ? ShmAlloc(h, 1000) : nullptr);
+                    const auto block =
+                        reinterpret_cast<uintptr_t>(h != nullptr ? ShmAlloc(h, 1000) : nullptr);
                     return block != 0 && write(result[1], &block, sizeof block) == sizeof block ? 0 : 2;
                 },
                 120));
@@ -379,7 +387,8 @@ TEST(ShmFlock, DescriptorLockTakenOnlyAfterASecondReadWriteAttach) {
     // A child allocating through the first handle must wait for the lock held above.
     const pid_t child = startChild([&] { return ShmAlloc(h, 1) != nullptr ? 0 : 1; }, 120);
     usleep(300 * 1000);
-    EXPECT_EQ(waitpid(child, nullptr, WNOHANG), 0) << "allocated while another description held the descriptor lock";
+    EXPECT_EQ(waitpid(child, nullptr, WNOHANG), 0)
+        << "allocated while another description held the descriptor lock";
     flock(other, LOCK_UN);
     EXPECT_EQ(waitStatus(child), 0);
     close(other);

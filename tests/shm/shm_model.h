@@ -24,7 +24,8 @@ inline uintptr_t classBytes(int k) { return uintptr_t{8} << k; }
  * free blocks keep their link apart from the next block's class word. */
 inline int modelClassFor(uint32_t n) {
     for (int k = 0; n < 0x40000000u && k < kClasses; k++) {
-        if (uint64_t{n} + sizeof(uintptr_t) <= classBytes(k) && 2 * sizeof(uintptr_t) <= classBytes(k)) return k;
+        if (uint64_t{n} + sizeof(uintptr_t) <= classBytes(k) && 2 * sizeof(uintptr_t) <= classBytes(k))
+            return k;
     }
     return -1;
 }
@@ -39,7 +40,8 @@ class BuddyModel {
     BuddyModel(uintptr_t header, uint32_t length) {
         uintptr_t position = header + static_cast<uintptr_t>(getpagesize());
         for (int k = kClasses - 1; k >= 0; k--) {
-            for (; header + length - position >= classBytes(k); position += classBytes(k)) lists_[k].insert(position);
+            for (; header + length - position >= classBytes(k); position += classBytes(k))
+                lists_[k].insert(position);
         }
     }
 
@@ -77,7 +79,8 @@ class BuddyModel {
 /* Walks list k of a header, at most `limit` entries (a cycle stops there). */
 inline std::vector<uintptr_t> walkList(const ShmHeader *h, int k, size_t limit = 1u << 20) {
     std::vector<uintptr_t> entries;
-    for (uintptr_t e = h->freeList[k]; e != 0 && entries.size() < limit; e = *reinterpret_cast<const uintptr_t *>(e)) {
+    for (uintptr_t e = h->freeList[k]; e != 0 && entries.size() < limit;
+         e = *reinterpret_cast<const uintptr_t *>(e)) {
         entries.push_back(e);
     }
     return entries;

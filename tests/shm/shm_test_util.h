@@ -116,19 +116,23 @@ inline int runInChild(const std::function<int()> &body, unsigned seconds) {
 }
 
 inline void fillPattern(void *block, uint32_t n, uint32_t tag) {
-    for (uint32_t i = 0; i < n; i++) static_cast<unsigned char *>(block)[i] = static_cast<unsigned char>(tag + i * 7);
+    for (uint32_t i = 0; i < n; i++)
+        static_cast<unsigned char *>(block)[i] = static_cast<unsigned char>(tag + i * 7);
 }
 
 inline bool patternIntact(const void *block, uint32_t n, uint32_t tag) {
     for (uint32_t i = 0; i < n; i++) {
-        if (static_cast<const unsigned char *>(block)[i] != static_cast<unsigned char>(tag + i * 7)) return false;
+        if (static_cast<const unsigned char *>(block)[i] != static_cast<unsigned char>(tag + i * 7))
+            return false;
     }
     return true;
 }
 
 /* The class word stored below a block, and the address a class word names. */
 inline uintptr_t classWordAt(uintptr_t block) { return reinterpret_cast<const uintptr_t *>(block)[-1]; }
-inline uintptr_t slotAddress(const ShmHeader *h, int k) { return reinterpret_cast<uintptr_t>(&h->freeList[k]); }
+inline uintptr_t slotAddress(const ShmHeader *h, int k) {
+    return reinterpret_cast<uintptr_t>(&h->freeList[k]);
+}
 
 /* A copy of the free-list heads, to prove that an operation changed nothing. */
 struct ListHeads {
@@ -141,10 +145,20 @@ struct ListHeads {
 } // namespace qorbu::test
 
 /* For GoogleTest files: a call returns 0 (or null) with errno err; a statement leaves errno at err. */
-#define EXPECT_REFUSED(err, call) \
-    do { errno = 0; const bool zero_ = (call) == 0; const int errno_ = errno; \
-         EXPECT_TRUE(zero_) << #call; EXPECT_EQ(errno_, err) << #call; } while (0)
-#define EXPECT_ERRNO(err, statement) \
-    do { errno = 0; statement; const int errno_ = errno; EXPECT_EQ(errno_, err) << #statement; } while (0)
+#define EXPECT_REFUSED(err, call)                                                                            \
+    do {                                                                                                     \
+        errno = 0;                                                                                           \
+        const bool zero_ = (call) == 0;                                                                      \
+        const int errno_ = errno;                                                                            \
+        EXPECT_TRUE(zero_) << #call;                                                                         \
+        EXPECT_EQ(errno_, err) << #call;                                                                     \
+    } while (0)
+#define EXPECT_ERRNO(err, statement)                                                                         \
+    do {                                                                                                     \
+        errno = 0;                                                                                           \
+        statement;                                                                                           \
+        const int errno_ = errno;                                                                            \
+        EXPECT_EQ(errno_, err) << #statement;                                                                \
+    } while (0)
 
 #endif

@@ -73,7 +73,7 @@ int g_alarms = 0;
 void on_alarm(unsigned int, void *) { ++g_alarms; }
 
 class NetSnmpAgent : public ::testing::Test {
-protected:
+  protected:
     void SetUp() override {
         ASSERT_NE(mkdtemp(dir), nullptr);
         port = free_udp_port();
@@ -94,7 +94,8 @@ protected:
         snmp_enable_stderrlog();
 
         ASSERT_EQ(init_agent(kAppName), 0);
-        ASSERT_EQ(netsnmp_register_int_instance("qorbuScalar", kScalarOid, OID_LENGTH(kScalarOid), &scalar, nullptr),
+        ASSERT_EQ(netsnmp_register_int_instance("qorbuScalar", kScalarOid, OID_LENGTH(kScalarOid), &scalar,
+                                                nullptr),
                   MIB_REGISTERED_OK);
         netsnmp_config_remember(const_cast<char *>("rocommunity public 127.0.0.1"));
         init_snmp(kAppName);
@@ -116,8 +117,8 @@ protected:
         posix_spawn_file_actions_adddup2(&actions, out[1], STDOUT_FILENO);
         posix_spawn_file_actions_addclose(&actions, out[0]);
         const std::string agent = "udp:127.0.0.1:" + std::to_string(port);
-        const char *argv[] = {QORBU_SNMPGET, "-v2c", "-c", "public", "-On", "-t", "5", "-r", "2",
-                              agent.c_str(), kScalarOidText, nullptr};
+        const char *argv[] = {QORBU_SNMPGET, "-v2c", "-c", "public",      "-On",          "-t",
+                              "5",           "-r",   "2",  agent.c_str(), kScalarOidText, nullptr};
         const int rc = posix_spawn(pid, QORBU_SNMPGET, &actions, nullptr, const_cast<char **>(argv), environ);
         posix_spawn_file_actions_destroy(&actions);
         close(out[1]);

@@ -13,34 +13,28 @@
 
 static int fired;
 
-static int on_timer(SelTimer *timer)
-{
+static int on_timer(SelTimer *timer) {
     (void)timer;
     fired = 1;
     return 0;
 }
 
-static void sleeper(void *arg)
-{
+static void sleeper(void *arg) {
     int *result = arg;
     int fds[2];
-    if (pipe(fds) != 0)
-        return;
+    if (pipe(fds) != 0) return;
     fcntl(fds[0], F_SETFL, O_NONBLOCK);
     *result = nb_poll(fds[0], POLLIN, 20); /* nothing comes: -1 after 20 ms */
     close(fds[0]);
     close(fds[1]);
 }
 
-int main(void)
-{
-    if (SelInit() != 0)
-        return 1;
+int main(void) {
+    if (SelInit() != 0) return 1;
     SelTimer timer = {0};
     timer.callback = on_timer;
     SelSleep(&timer, 10);
-    while (!fired)
-        SelSelect();
+    while (!fired) SelSelect();
 
     int polled = 0;
     greenthreads_init();
@@ -50,8 +44,7 @@ int main(void)
     char name[64];
     snprintf(name, sizeof name, "qorbu-minimal-host-%d", (int)getpid());
     ShmHandle *segment = ShmCreate(name, NULL, 65536);
-    if (!segment)
-        return 2;
+    if (!segment) return 2;
     void *block = ShmAlloc(segment, 100);
     unsigned int freeWithBlock = ShmTotalFree(segment);
     ShmFree(segment, block);
