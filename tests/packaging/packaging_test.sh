@@ -41,7 +41,7 @@ lacks() { contents "$1" | grep -Eq -- "$2" && fail "$1 should not hold $2"; }
 has libqorbu5 '^/usr/lib/.*/libqorbu\.so\.5$'
 has libqorbu5 '^/usr/lib/.*/libqorbu\.so\.5\.0\.0$'
 lacks libqorbu5 '\.h$|/libqorbu\.so$|pkgconfig'
-for header in selector/sel.h selector/host.h shm/shm.h greenthreads/greenthread.h nbio/nb.h; do
+for header in qorbu_api.h selector/sel.h selector/host.h shm/shm.h greenthreads/greenthread.h nbio/nb.h; do
     has libqorbu-dev "^/usr/include/qorbu/$header\$"
 done
 lacks libqorbu-dev '_private\.h$'
