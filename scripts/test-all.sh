@@ -10,7 +10,7 @@ source scripts/require-packages.sh
 
 require_packages cmake ninja-build g++ gcc googletest valgrind pkg-config \
     g++-arm-linux-gnueabihf g++-i686-linux-gnu qemu-user \
-    libsnmp-dev snmp clang clang-format libclang-rt-14-dev dpkg-dev file || exit 1
+    libsnmp-dev snmp clang clang-format libclang-rt-14-dev dpkg-dev file lintian || exit 1
 
 jobs=$(nproc)
 failed=()

@@ -1,8 +1,10 @@
 #!/bin/bash
 # Builds the Debian packages from a fresh tree configured for /usr, checks
-# their names, dependencies and contents, unpacks them into a scratch root
-# with dpkg -x and builds a small C host against the unpacked files, once
-# with pkg-config and once with find_package(qorbu).
+# their names, dependencies and contents, has lintian check them (any error or
+# warning fails), unpacks them into a scratch root with dpkg -x and builds a
+# small C host against the unpacked files, once with pkg-config and once with
+# find_package(qorbu). Last, the same tree installed under another prefix
+# runs its programs without LD_LIBRARY_PATH.
 # Usage: packaging_test.sh SOURCE_DIR SCRATCH_DIR
 set -u
 SRC=$1 W=$2
@@ -39,7 +41,7 @@ lacks() { contents "$1" | grep -Eq -- "$2" && fail "$1 should not hold $2"; }
 has libqorbu5 '^/usr/lib/.*/libqorbu\.so\.5$'
 has libqorbu5 '^/usr/lib/.*/libqorbu\.so\.5\.0\.0$'
 lacks libqorbu5 '\.h$|/libqorbu\.so$|pkgconfig'
-for header in selector/sel.h selector/host.h shm/shm.h greenthreads/greenthread.h nbio/nb.h; do
+for header in qorbu_api.h selector/sel.h selector/host.h shm/shm.h greenthreads/greenthread.h nbio/nb.h; do
     has libqorbu-dev "^/usr/include/qorbu/$header\$"
 done
 lacks libqorbu-dev '_private\.h$'
@@ -48,8 +50,16 @@ has libqorbu-dev '^/usr/lib/.*/pkgconfig/qorbu\.pc$'
 has libqorbu-dev '^/usr/lib/.*/cmake/qorbu/qorbuConfig\.cmake$'
 has libqorbu-dev '^/usr/lib/.*/cmake/qorbu/qorbuTargets\.cmake$'
 lacks libqorbu-dev 'libqorbu\.so\.5'
-has qorbu-tools '^/usr/bin/qorbu-shm$'
-if [ -x "$W/build/examples/qorbu-demo" ]; then has qorbu-tools '^/usr/bin/qorbu-demo$'; fi
+for program in qorbu-shm qorbu-demo; do
+    [ "$program" = qorbu-shm ] || [ -x "$W/build/examples/$program" ] || continue
+    has qorbu-tools "^/usr/bin/$program\$"
+    has qorbu-tools "^/usr/share/man/man1/$program\.1\.gz\$"
+done
+
+step "lintian"
+# No overrides: every tag applies to these packages as it would to Debian's.
+lintian --fail-on error,warning "$(deb libqorbu5)" "$(deb libqorbu-dev)" "$(deb qorbu-tools)" \
+    >"$W/lintian.log" 2>&1 || { cat "$W/lintian.log"; fail "lintian"; }
 
 step "dpkg -x into a scratch root"
 ROOT=$W/root
@@ -81,6 +91,22 @@ fi
 step "the unpacked tools run"
 "$ROOT/usr/bin/qorbu-shm" --help >/dev/null || fail "qorbu-shm --help"
 if [ -x "$ROOT/usr/bin/qorbu-demo" ]; then "$ROOT/usr/bin/qorbu-demo" --help >/dev/null || fail "qorbu-demo --help"; fi
+
+step "a prefix install runs without LD_LIBRARY_PATH"
+unset LD_LIBRARY_PATH
+cmake --install "$W/build" --prefix "$W/prefix" >"$W/install.log" 2>&1 || { cat "$W/install.log"; die "cmake --install"; }
+# qorbu-shm carries the allocator's internals itself; the demo loads the library.
+if [ -x "$W/prefix/bin/qorbu-demo" ]; then
+    ldd "$W/prefix/bin/qorbu-demo" | grep -q "libqorbu\.so\.5 => $W/prefix/" ||
+        fail "qorbu-demo does not load the library of its prefix: $(ldd "$W/prefix/bin/qorbu-demo")"
+    "$W/prefix/bin/qorbu-demo" --help >/dev/null || fail "qorbu-demo from the prefix"
+fi
+SEGMENT=qorbu-packaging-$$
+"$W/prefix/bin/qorbu-shm" create "$SEGMENT" 4096 >/dev/null && "$W/prefix/bin/qorbu-shm" info "$SEGMENT" >/dev/null ||
+    fail "qorbu-shm from the prefix"
+"$W/prefix/bin/qorbu-shm" unlink "$SEGMENT" 2>/dev/null
+[ -f "$W/prefix/share/man/man1/qorbu-shm.1.gz" ] || fail "the prefix install lacks qorbu-shm(1)"
+[ ! -e "$W/prefix/share/doc" ] || fail "the prefix install holds the packages' Debian documents"
 
 if [ "$FAILURES" != 0 ]; then
     echo "packaging: $FAILURES check(s) failed"
