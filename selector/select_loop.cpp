@@ -304,7 +304,7 @@ extern "C" QORBU_API int SelSelect(void) {
          *    and a host task already due gives a zero time-out. */
         auto offer = [&](TimeoutSource source, const struct timespec &candidate) {
             if (source == TimeoutSource::Zero || chosen == TimeoutSource::None ||
-                SelTimerBefore(&candidate, &timeout)) {
+                deadline_before(candidate, timeout)) {
                 chosen = source;
                 timeout = candidate;
             }

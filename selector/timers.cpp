@@ -74,7 +74,7 @@ void remove_timer(SelContext *ctx, SelTimer *t) {
     SelTimer *moved = ctx->timerHeap[last];
     ctx->timerHeap[last] = nullptr;
     place(ctx, i, moved);
-    if (i > 1 && SelTimerBefore(&moved->when, &ctx->timerHeap[i / 2]->when))
+    if (i > 1 && deadline_before(moved->when, ctx->timerHeap[i / 2]->when))
         SelHeapUp(ctx, i);
     else
         SelHeapDown(ctx, i);
@@ -91,7 +91,7 @@ inline void prefetch_grandchildren(SelTimer *const *heap, uint32_t left, uint32_
     for (uint32_t g = first; g < first + kGrandchildren; ++g) __builtin_prefetch(&heap[g]->when);
 }
 
-bool is_due(const SelTimer *t, const struct timespec &now) { return !SelTimerBefore(&now, &t->when); }
+bool is_due(const SelTimer *t, const struct timespec &now) { return !deadline_before(now, t->when); }
 
 // Whether the timer is due by the clock as it reads now. A reading taken
 // before the last callback serves as long as it already shows the timer due:
@@ -108,16 +108,14 @@ bool due_by_clock(const SelTimer *t, struct timespec &now, bool &fresh) {
 
 extern "C" {
 
-int SelTimerBefore(const struct timespec *a, const struct timespec *b) {
-    return a->tv_sec < b->tv_sec || (a->tv_sec == b->tv_sec && a->tv_nsec < b->tv_nsec);
-}
+int SelTimerBefore(const struct timespec *a, const struct timespec *b) { return deadline_before(*a, *b); }
 
 void SelHeapUp(SelContext *ctx, uint32_t slot) {
     SelTimer **heap = ctx->timerHeap;
     SelTimer *t = heap[slot];
     while (slot > 1) {
         SelTimer *parent = heap[slot / 2];
-        if (!SelTimerBefore(&t->when, &parent->when)) break;
+        if (!deadline_before(t->when, parent->when)) break;
         place(ctx, slot, parent);
         slot /= 2;
     }
@@ -135,8 +133,8 @@ void SelHeapDown(SelContext *ctx, uint32_t slot) {
         uint32_t right = left + 1;
         uint32_t child = left;
         // On equal deadlines the right child goes up.
-        if (right <= count && !SelTimerBefore(&heap[left]->when, &heap[right]->when)) child = right;
-        if (!SelTimerBefore(&heap[child]->when, &t->when)) break;
+        if (right <= count && !deadline_before(heap[left]->when, heap[right]->when)) child = right;
+        if (!deadline_before(heap[child]->when, t->when)) break;
         place(ctx, slot, heap[child]);
         slot = child;
     }
@@ -192,7 +190,7 @@ int SelModifyTimer(SelTimer *t, const struct timespec *when) {
         return add_timer(ctx, t);
     }
     if (t->callback == nullptr || !holds(ctx, t)) abort();
-    bool later = SelTimerBefore(&t->when, when);
+    bool later = deadline_before(t->when, *when);
     t->when = *when;
     if (later)
         SelHeapDown(ctx, t->heapIndex);
