@@ -135,15 +135,28 @@ inline void prefetch_grandchildren(SelTimer *const *heap, uint32_t left, uint32_
     remove_at(ctx, i, t);
 }
 
+// The new deadline is copied field by field: callers have usually just built
+// it with two separate stores, and one wide load across both (which the
+// compiler would otherwise make of the copy) cannot take their values from
+// the store buffer; it waits until both have reached the cache. The empty asm
+// keeps the fields in general registers.
+[[gnu::always_inline]] inline void set_when(SelTimer *t, const struct timespec *when) {
+    time_t sec = when->tv_sec;
+    long nsec = when->tv_nsec;
+    asm("" : "+r"(sec), "+r"(nsec));
+    t->when.tv_sec = sec;
+    t->when.tv_nsec = nsec;
+}
+
 [[gnu::always_inline]] inline int modify_timer(SelContext *ctx, SelTimer *t, const struct timespec *when) {
     const uint32_t i = t->heapIndex;
     if (i == 0) {
-        t->when = *when;
+        set_when(t, when);
         return add_timer(ctx, t);
     }
     if (__builtin_expect(t->callback == nullptr || !holds(ctx, t), 0)) abort();
     const bool later = deadline_before(t->when, *when);
-    t->when = *when;
+    set_when(t, when);
     SelTimer **heap = ctx->timerHeap;
     const uint32_t slot =
         later ? sift_down(heap, static_cast<uint32_t>(ctx->timerCount), i, t) : sift_up(heap, i, t);
