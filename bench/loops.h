@@ -99,7 +99,7 @@ using bench::Rng;
 // libevent's default clock, CLOCK_MONOTONIC_COARSE (a few ms per tick).
 constexpr long kFarBaseUs = 1000L * 1000 * 1000;
 constexpr long kFarSpanUs = 1000L * 1000 * 1000;
-constexpr long kNearSpanUs = 1000;
+constexpr long kNearSpanUs = 5000;
 inline long fired = 0; // callbacks run since the last reset
 
 inline long far_us(Rng &r) { return kFarBaseUs + long(r.next() % kFarSpanUs); }

@@ -50,7 +50,7 @@ int epoll_pass(bool sleep_without_timer) {
     if (n == 0) {
         /* 3. Nothing ready: fire the due timers; a pass that fired any ends here. */
         struct timespec now;
-        SelGetTime(&now);
+        read_clock(&now);
         if (SelRunTimers(ctx) > 0) return 0;
         /* 4. Block for one event until the earliest timer (not at all without
          *    one, unless the run loop asks to sleep), the registered signals

@@ -10,6 +10,7 @@
 
 #ifdef __cplusplus
 #include <atomic>
+#include <ctime>
 #endif
 
 #ifdef __cplusplus
@@ -104,6 +105,13 @@ inline constexpr int kSelectSetSize = FD_SETSIZE;
 inline constexpr int kMaxSignal = 64;
 inline constexpr int kTimerMisuse = -117;
 inline constexpr int kErestart = 85;
+
+/* The deadline order (SelTimerBefore), inline for the heap's loops and the
+ * dispatch loops: a is before b when its seconds are less, or equal with
+ * fewer nanoseconds; both fields compare as signed numbers. */
+inline bool deadline_before(const struct timespec &a, const struct timespec &b) {
+    return a.tv_sec < b.tv_sec || (a.tv_sec == b.tv_sec && a.tv_nsec < b.tv_nsec);
+}
 
 /* The process-wide epoll instance; 0 means select mode. */
 extern std::atomic<int> epoll_fd;

@@ -288,7 +288,7 @@ extern "C" QORBU_API int SelSelect(void) {
     if (ready == 0) {
         /* 6. Nothing ready: fire the due timers; a pass that fired any ends here. */
         struct timespec now;
-        SelGetTime(&now);
+        read_clock(&now);
         if (SelRunTimers(ctx) > 0) return 0;
 
         /* 7. Run the host's queue again and take fresh working sets. */
@@ -304,7 +304,7 @@ extern "C" QORBU_API int SelSelect(void) {
          *    and a host task already due gives a zero time-out. */
         auto offer = [&](TimeoutSource source, const struct timespec &candidate) {
             if (source == TimeoutSource::Zero || chosen == TimeoutSource::None ||
-                SelTimerBefore(&candidate, &timeout)) {
+                deadline_before(candidate, timeout)) {
                 chosen = source;
                 timeout = candidate;
             }

@@ -1,6 +1,6 @@
 /* Time arithmetic shared by the timers, the two dispatch loops, zarn_select
- * and nb_poll: the unit constants and the conversions between milliseconds,
- * timespec and timeval. */
+ * and nb_poll: the unit constants, the monotonic clock and the conversions
+ * between milliseconds, timespec and timeval. */
 #ifndef QORBU_SELECTOR_TIME_PRIVATE_H
 #define QORBU_SELECTOR_TIME_PRIVATE_H
 
@@ -15,6 +15,13 @@ inline constexpr long kNsecPerMsec = 1000000L;
 inline constexpr long kNsecPerUsec = 1000L;
 inline constexpr long kUsecPerSec = 1000000L;
 inline constexpr long kMsecPerSec = 1000L;
+
+/* What SelGetTime does, for the library's own callers: no call through the
+ * exported symbol, and the failure path out of line. */
+[[noreturn, gnu::cold]] void clock_failed();
+[[gnu::always_inline]] inline void read_clock(struct timespec *now) {
+    if (__builtin_expect(clock_gettime(CLOCK_MONOTONIC, now) != 0, 0)) clock_failed();
+}
 
 /* later - earlier, borrowing a second when the nanoseconds come out negative. */
 inline struct timespec timespec_sub(const struct timespec &later, const struct timespec &earlier) {

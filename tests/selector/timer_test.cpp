@@ -56,6 +56,51 @@ void expect_heap_consistent(const SelContext *ctx) {
     ASSERT_EQ(ctx->timerHeap[1] == nullptr, ctx->timerCount == 0);
 }
 
+// The heap as documented, one step at a time: the library must leave every
+// timer in the same slot, which fixes the order in which equal deadlines fire.
+struct ModelHeap {
+    std::vector<SelTimer *> slot{nullptr};
+    static bool before(const struct timespec &a, const struct timespec &b) {
+        return a.tv_sec < b.tv_sec || (a.tv_sec == b.tv_sec && a.tv_nsec < b.tv_nsec);
+    }
+    size_t last() const { return slot.size() - 1; }
+    void up(size_t i) {
+        SelTimer *t = slot[i];
+        for (; i > 1 && before(t->when, slot[i / 2]->when); i /= 2) slot[i] = slot[i / 2];
+        slot[i] = t;
+    }
+    void down(size_t i) {
+        SelTimer *t = slot[i];
+        for (size_t c; (c = 2 * i) <= last(); i = c) {
+            if (c + 1 <= last() && !before(slot[c]->when, slot[c + 1]->when)) ++c; // right wins ties
+            if (!before(slot[c]->when, t->when)) break;
+            slot[i] = slot[c];
+        }
+        slot[i] = t;
+    }
+    void add(SelTimer *t) {
+        slot.push_back(t);
+        up(last());
+    }
+    void remove(SelTimer *t) {
+        size_t i = size_t(std::find(slot.begin() + 1, slot.end(), t) - slot.begin());
+        if (i > last()) return;
+        slot[i] = slot[last()];
+        slot.pop_back();
+        if (i > last()) return;
+        if (i > 1 && before(slot[i]->when, slot[i / 2]->when))
+            up(i);
+        else
+            down(i);
+    }
+    // After the library gave t its new deadline; later: the old one was before it.
+    void rearmed(SelTimer *t, bool later) {
+        size_t i = size_t(std::find(slot.begin() + 1, slot.end(), t) - slot.begin());
+        if (i > last()) return add(t);
+        later ? down(i) : up(i);
+    }
+};
+
 class TimerHeapTest : public SelectorTest {
   protected:
     void SetUp() override {
@@ -175,31 +220,46 @@ TEST_F(TimerHeapTest, RandomOperationsKeepDeadlineOrder) {
         FAIL() << "timer missing from reference";
     };
     for (SelTimer &t : timers) t = make_timer(at(0));
+    ModelHeap model;
+    // Few distinct deadlines, so equal deadlines are common; among them the
+    // extremes of both fields, which are compared as signed values.
+    constexpr time_t kSecs[] = {std::numeric_limits<time_t>::min(), -1, std::numeric_limits<time_t>::max()};
+    constexpr long kNsecs[] = {0, 100, 200, -1, 999999999L, std::numeric_limits<long>::min()};
 
     for (int step = 0; step < 20000; ++step) {
         SelTimer *t = &timers[rng() % kTimers];
-        // Few distinct deadlines, so equal deadlines are common.
-        struct timespec when = at(static_cast<long>(rng() % 50), static_cast<long>(rng() % 3) * 100);
+        struct timespec when = at(static_cast<long>(rng() % 50), kNsecs[rng() % 3]);
+        if (rng() % 8 == 0) {
+            when.tv_sec = kSecs[rng() % 3];
+            when.tv_nsec = kNsecs[rng() % 6];
+        }
         switch (rng() % 3) {
         case 0:
             if (t->heapIndex == 0) {
                 t->when = when;
                 ASSERT_EQ(SelAddTimer(t), 0);
                 reference.emplace(key(*t), t);
+                model.add(t);
             }
             break;
-        case 1:
+        case 1: {
+            const bool later = ModelHeap::before(t->when, when);
             if (t->heapIndex != 0) erase_ref(t);
             ASSERT_EQ(SelModifyTimer(t, &when), 0);
+            model.rearmed(t, later);
             reference.emplace(key(*t), t);
             break;
+        }
         default:
             if (t->heapIndex != 0) erase_ref(t);
+            model.remove(t);
             SelRemTimer(t);
             ASSERT_EQ(t->heapIndex, 0u);
             break;
         }
         ASSERT_EQ(ctx->timerCount, static_cast<int32_t>(reference.size()));
+        ASSERT_TRUE(std::equal(model.slot.begin() + 1, model.slot.end(), ctx->timerHeap + 1))
+            << "step " << step;
         if (step % 97 == 0) expect_heap_consistent(ctx);
     }
     expect_heap_consistent(ctx);
