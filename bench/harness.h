@@ -152,6 +152,9 @@ struct Column {
     std::string name;
     Role role;
 };
+inline Column ours(const char *name) { return {name, Role::Ours}; }
+inline Column peer(const char *name) { return {name, Role::Peer}; }
+inline Column floor_of(const char *name) { return {name, Role::Floor}; }
 
 struct Row {
     std::string label;  // first column of the table
@@ -169,6 +172,11 @@ struct Section {
     std::vector<Column> columns;
     std::vector<Row> rows;
     std::vector<std::string> verdicts; // target lines, filled by the driver
+
+    Section(std::string id_, std::string row_head_, std::string xlabel_, bool logx_,
+            std::vector<Column> columns_ = {})
+        : id(std::move(id_)), row_head(std::move(row_head_)), xlabel(std::move(xlabel_)), logx(logx_),
+          columns(std::move(columns_)) {}
 
     void add(std::string label, double x, std::string series, std::vector<double> med) {
         rows.push_back({std::move(label), x, std::move(series), std::move(med)});
@@ -226,18 +234,21 @@ inline std::string check(const Section &s, const std::string &target, const std:
     return b;
 }
 
+// Ends a driver whose set-up failed: its figures would mean nothing.
+inline void require(bool ok, const char *what) {
+    if (ok) return;
+    perror(what);
+    exit(1);
+}
+
 inline FILE *open_out(const Options &o, const std::string &name) {
     std::string path = o.out_dir + "/" + name;
     FILE *f = fopen(path.c_str(), "w");
-    if (!f) {
-        perror(path.c_str());
-        exit(1);
-    }
+    require(f != nullptr, path.c_str());
     return f;
 }
 
-inline void write_markdown(const Options &o, const Section &s) {
-    FILE *f = open_out(o, s.id + ".md");
+inline void write_markdown(const Options &o, const Section &s, FILE *f) {
     fprintf(f,
             "Median ns per operation over %d interleaved repetitions; in brackets the ratio to the best "
             "peer of the row.\n\n| %s |",
@@ -262,7 +273,6 @@ inline void write_markdown(const Options &o, const Section &s) {
         fprintf(f, "\nTargets:\n\n");
         for (auto &v : s.verdicts) fprintf(f, "- %s\n", v.c_str());
     }
-    fclose(f);
 }
 
 inline std::string gp_quote(const std::string &s) {
@@ -314,17 +324,11 @@ inline void write_plot(const Options &o, const Section &s) {
 }
 
 inline void write(const Options &o, const Section &s) {
-    write_markdown(o, s);
+    FILE *f = open_out(o, s.id + ".md");
+    write_markdown(o, s, f);
+    fclose(f);
     write_plot(o, s);
-    // echo the table on stdout for whoever runs the driver by hand
-    printf("== %s\n", s.id.c_str());
-    for (size_t r = 0; r < s.rows.size(); ++r) {
-        printf("  %-18s", s.rows[r].label.c_str());
-        for (size_t i = 0; i < s.columns.size(); ++i)
-            printf(" %s=%s", s.columns[i].name.c_str(), fmt(s.rows[r].median[i]).c_str());
-        printf("\n");
-    }
-    for (auto &v : s.verdicts) printf("  %s\n", v.c_str());
+    write_markdown(o, s, stdout); // for whoever runs the driver by hand
     fflush(stdout);
 }
 

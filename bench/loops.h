@@ -32,15 +32,9 @@ struct Chain {
     Chain(int pipes, int tokens) : n(pipes), active(tokens) {
         for (int i = 0; i < n; ++i) {
             int p[2];
-            if (pipe2(p, O_NONBLOCK) != 0) {
-                perror("pipe2");
-                exit(1);
-            }
+            bench::require(pipe2(p, O_NONBLOCK) == 0, "pipe2");
             int w = fcntl(p[1], F_DUPFD_CLOEXEC, kHighFd);
-            if (w < 0) {
-                perror("F_DUPFD");
-                exit(1);
-            }
+            bench::require(w >= 0, "F_DUPFD");
             close(p[1]);
             rfd.push_back(p[0]);
             wfd.push_back(w);

@@ -47,15 +47,9 @@ struct QorbuLoop : Loop {
     Chain &c;
     bool epoll;
     QorbuLoop(Chain &chain, bool use_epoll) : c(chain), epoll(use_epoll) {
-        if (epoll && SelUseEpoll() != 0) {
-            perror("SelUseEpoll");
-            exit(1);
-        }
+        require(!epoll || SelUseEpoll() == 0, "SelUseEpoll");
         for (auto &nd : c.nodes)
-            if (SelAddFD(c.rfd[size_t(nd.index)], SEL_READ, 0, qorbu_cb, &nd) != 0) {
-                perror("SelAddFD");
-                exit(1);
-            }
+            require(SelAddFD(c.rfd[size_t(nd.index)], SEL_READ, 0, qorbu_cb, &nd) == 0, "SelAddFD");
     }
     ~QorbuLoop() override {
         for (int fd : c.rfd) SelRemFD(fd);
@@ -139,8 +133,8 @@ int main(int argc, char **argv) {
         {"read+write", 2, Role::Floor, nullptr},
     };
 
-    Section sel{"dispatch_select", "pipes N, active A", "pipes N", true, {}, {}, {}};
-    Section ep{"dispatch_epoll", "pipes N, active A", "pipes N", true, {}, {}, {}};
+    Section sel("dispatch_select", "pipes N, active A", "pipes N", true);
+    Section ep("dispatch_epoll", "pipes N, active A", "pipes N", true);
     for (auto &e : entries) {
         if (e.section != 1) sel.columns.push_back({e.name, e.role});
         if (e.section != 0) ep.columns.push_back({e.name, e.role});

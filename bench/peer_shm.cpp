@@ -160,10 +160,7 @@ std::string name_of(const char *tag) { return "qorbu_bench_" + std::to_string(ge
 ShmHandle *create_segment(const std::string &name) {
     ShmUnlink(name.c_str());
     ShmHandle *h = ShmCreate(name.c_str(), nullptr, kSegment);
-    if (!h) {
-        perror("ShmCreate");
-        exit(1);
-    }
+    require(h != nullptr, "ShmCreate");
     return h;
 }
 
@@ -180,10 +177,7 @@ int main(int argc, char **argv) {
     ShmHandle *lock = create_segment(n_lock);
     ShmHandle *second = ShmOpen(n_lock.c_str(), O_RDWR);
     ShmHandle *two = create_segment(n_two);
-    if (!second || !two) {
-        perror("ShmOpen");
-        return 1;
-    }
+    require(second && two, "ShmOpen");
     std::string b_one = name_of("boost1"), b_two = name_of("boost2");
     bip::shared_memory_object::remove(b_one.c_str());
     bip::shared_memory_object::remove(b_two.c_str());
@@ -197,17 +191,9 @@ int main(int argc, char **argv) {
     Heap *heaps[] = {&q_nolock, &q_lock, &bh, &mh, &fh};
     std::vector<std::unique_ptr<Workload>> ws;
     for (Heap *h : heaps) ws.emplace_back(new Workload(h, kLive, 7));
-    Section one{"shm_one_process",
-                "block size (bytes)",
-                "block size (bytes)",
-                true,
-                {{"libqorbu", Role::Ours},
-                 {"libqorbu+flock", Role::Ours},
-                 {"Boost.Interprocess", Role::Peer},
-                 {"glibc malloc", Role::Floor},
-                 {"4 flock calls", Role::Floor}},
-                {},
-                {}};
+    Section one("shm_one_process", "block size (bytes)", "block size (bytes)", true,
+                {ours("libqorbu"), ours("libqorbu+flock"), peer("Boost.Interprocess"),
+                 floor_of("glibc malloc"), floor_of("4 flock calls")});
     auto figure = [&](uint32_t size) {
         std::vector<Contender> cs;
         for (size_t i = 0; i < ws.size(); ++i) {
@@ -221,16 +207,9 @@ int main(int argc, char **argv) {
     one.add("mixed 16..4096", NAN, "", figure(0));
     fprintf(stderr, "shm: one process done\n");
 
-    Section twop{"shm_two_processes",
-                 "operation",
-                 "",
-                 false,
-                 {{"libqorbu", Role::Ours},
-                  {"Boost.Interprocess", Role::Peer},
-                  {"glibc malloc", Role::Floor},
-                  {"4 flock calls", Role::Floor}},
-                 {},
-                 {}};
+    Section twop(
+        "shm_two_processes", "operation", "", false,
+        {ours("libqorbu"), peer("Boost.Interprocess"), floor_of("glibc malloc"), floor_of("4 flock calls")});
     std::string two_name = n_two;
     std::vector<Attach> attach = {
         [two_name]() -> Heap * {

@@ -106,16 +106,8 @@ int main(int argc, char **argv) {
     SelInit();
     greenthreads_init();
 
-    Section s{"switching",
-              "operation",
-              "",
-              false,
-              {{"libqorbu", Role::Ours},
-               {"swapcontext", Role::Peer},
-               {"Boost.Context", Role::Peer},
-               {"sigprocmask", Role::Floor}},
-              {},
-              {}};
+    Section s("switching", "operation", "", false,
+              {ours("libqorbu"), peer("swapcontext"), peer("Boost.Context"), floor_of("sigprocmask")});
     auto row = [&](const char *label, std::vector<void (*)(long)> bodies) {
         std::vector<Contender> cs;
         for (size_t i = 0; i < bodies.size(); ++i) cs.push_back({s.columns[i].name, timed(o, bodies[i])});
