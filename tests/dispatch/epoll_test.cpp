@@ -266,6 +266,9 @@ TEST_F(Epoll, RegisteredSignalDuringTheWaitInterruptsThePass) {
     EXPECT_EQ(result, -1);
     EXPECT_EQ(error, EINTR);
     EXPECT_GE(g_handled, 1);
+    sigset_t now;
+    pthread_sigmask(SIG_BLOCK, nullptr, &now);
+    EXPECT_EQ(sigismember(&now, SIGUSR1), 1) << "blocked again after the wait";
 }
 
 TEST_F(Epoll, BlockingWaitTimeoutIsTruncatedToMilliseconds) {
@@ -276,9 +279,9 @@ TEST_F(Epoll, BlockingWaitTimeoutIsTruncatedToMilliseconds) {
     t.callback = log_timer;
     t.when = {100, 2500000};
     ASSERT_EQ(SelAddTimer(&t), 0);
-    /* Plain, borrowing a second, under a millisecond, whole seconds. */
+    /* Plain, borrowing a second, under a millisecond, whole seconds, overdue (no wait). */
     const std::pair<timespec, int> cases[] = {
-        {{100, 0}, 2}, {{99, 999000000}, 3}, {{100, 1600000}, 0}, {{98, 0}, 2002}};
+        {{100, 0}, 2}, {{99, 999000000}, 3}, {{100, 1600000}, 0}, {{98, 0}, 2002}, {{101, 0}, 0}};
     for (auto [now, ms] : cases)
         EXPECT_EQ(epoll_timeout_ms(ctx, now), ms) << now.tv_sec << "s " << now.tv_nsec << "ns";
     SelRemTimer(&t);

@@ -242,6 +242,15 @@ TEST_F(SelectPass, ReadableSnmpDescriptorGetsOneSnmpReadAndResetsTheEinvalCount)
 TEST_F(SelectPass, RegisteredSignalIsDeliveredOnlyDuringTheBlockingWait) {
     use_host();
     register_counted_sigusr1();
+    /* SIGUSR2 is the caller's own: blocked, unregistered, kept pending throughout. */
+    struct sigaction sa {};
+    sa.sa_handler = count_signal;
+    ASSERT_EQ(sigaction(SIGUSR2, &sa, nullptr), 0);
+    sigset_t usr2;
+    sigemptyset(&usr2);
+    sigaddset(&usr2, SIGUSR2);
+    ASSERT_EQ(sigprocmask(SIG_BLOCK, &usr2, nullptr), 0);
+    ASSERT_EQ(raise(SIGUSR2), 0);
     ASSERT_EQ(raise(SIGUSR1), 0); /* blocked: stays pending */
     Pipe p(40);
     p.fill();
@@ -261,9 +270,10 @@ TEST_F(SelectPass, RegisteredSignalIsDeliveredOnlyDuringTheBlockingWait) {
     EXPECT_EQ(errno, EINTR);
     sigset_t now;
     sigprocmask(SIG_BLOCK, nullptr, &now); /* ThreadSanitizer runs deferred handlers here */
-    EXPECT_EQ(g_handled, 1);
+    EXPECT_EQ(g_handled, 1) << "only the registered signal is unblocked for the wait";
     EXPECT_EQ(times("select_nb"), servicedBefore) << "no servicing after an interrupted wait";
     EXPECT_EQ(sigismember(&now, SIGUSR1), 1) << "blocked again after the wait";
+    EXPECT_EQ(sigismember(&now, SIGUSR2), 1);
 }
 
 /* --- dispatch order ------------------------------------------------------ */

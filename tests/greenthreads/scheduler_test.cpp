@@ -1,5 +1,7 @@
 // The run queue, yield/block/wakeup, record reuse and the run loop. Every
 // test case runs in a fresh process, so each starts with a fresh scheduler.
+#include <sys/timerfd.h>
+
 #include <chrono>
 #include <thread>
 
@@ -222,7 +224,8 @@ void block_until_timer(void *arg) {
 }
 
 /* Every thread blocks: the run loop waits in the selector until the timer
- * wakes the last one, and returns once that one ends. */
+ * (the only one armed) wakes the last one, and returns once that one ends.
+ * A descriptor readable after 10 s ends a wait that overlooked the timer. */
 TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds) {
     for (const bool epoll : {false, true}) {
         SCOPED_TRACE(epoll ? "epoll mode" : "select mode");
@@ -230,6 +233,12 @@ TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds)
             ASSERT_EQ(SelUseEpoll(), 0);
             ASSERT_NE(GetEpollFd(), 0);
         }
+        SelRemoveAllTimers(); // the reaper's, when this thread owns it
+        const int guard = timerfd_create(CLOCK_MONOTONIC, TFD_CLOEXEC);
+        const itimerspec tenSeconds{{0, 0}, {10, 0}};
+        ASSERT_EQ(timerfd_settime(guard, 0, &tenSeconds, nullptr), 0);
+        int guardEvents = 0;
+        ASSERT_EQ(SelAddFD(guard, SEL_READ, 0, count_pass, &guardEvents), 0);
         trace.clear();
         TimerWake wake{};
         wake.thread = greenthread_create(block_until_timer, &wake);
@@ -241,6 +250,9 @@ TEST_F(Scheduler, AllBlockedFallsBackOnTheSelectorOrEpollUntilTheLastThreadEnds)
         EXPECT_EQ(wake.timer.heapIndex, 0u);
         EXPECT_EQ(wake.thread->runnable, kFinished);
         EXPECT_EQ(free_threads, wake.thread) << "the timer's thread finished last";
+        EXPECT_EQ(guardEvents, 0) << "the wait ignored the armed timer";
+        SelRemFD(guard);
+        close(guard);
     }
     DeInitEpoll();
 }

@@ -72,9 +72,15 @@ TEST_F(SelectorTest, SetZGStoresAndClearsTheHostContext) {
 }
 
 TEST_F(SelectorTest, SignalsAreBlockedWhileRegistered) {
+    sigset_t only;
+    sigemptyset(&only);
+    sigaddset(&only, SIGUSR2);
+    pthread_sigmask(SIG_BLOCK, &only, nullptr);
     ASSERT_FALSE(blocked_in_thread(SIGUSR1));
     EXPECT_EQ(SelAddSignal(SIGUSR1), 0);
     EXPECT_TRUE(blocked_in_thread(SIGUSR1));
+    EXPECT_TRUE(blocked_in_thread(SIGUSR2)) << "the caller's own blocked signals stay blocked";
+    pthread_sigmask(SIG_UNBLOCK, &only, nullptr);
     EXPECT_EQ(sigismember(&ctx->signals, SIGUSR1), 1);
 
     errno = 0;
