@@ -303,6 +303,24 @@ TEST(ShmFree, NullAndForeignPointersChangeNothing) {
 
 using ShmFreeDeathTest = ExampleSegment;
 
+// a and b are partners, and c is the partner of the block they merge into,
+// so the merge stops there: the merged block must be known by its new class.
+TEST_F(ShmFreeDeathTest, DoubleFreeOfABlockThatMergedUpIsCaught) {
+    char *a = static_cast<char *>(ShmAlloc(h, 100));
+    char *b = static_cast<char *>(ShmAlloc(h, 100));
+    char *c = static_cast<char *>(ShmAlloc(h, 200));
+    ASSERT_TRUE(a && b && c);
+    ASSERT_EQ(b - a, 128);
+    ASSERT_EQ(c - a, 256);
+    EXPECT_EXIT(
+        {
+            ShmFree(h, a);
+            ShmFree(h, b);
+            ShmFree(h, a);
+        },
+        testing::ExitedWithCode(100), "^ShmFree\\(\\): double-free\n$");
+}
+
 TEST_F(ShmFreeDeathTest, DoubleFreeEndsWithStatus100AndLeavesTheSegmentUsable) {
     // A second read-write handle, so the descriptor lock is in play too.
     ShmHandle *second = ShmOpen(name.c_str(), O_RDWR);
