@@ -1,6 +1,7 @@
 #!/bin/bash
-# qorbu-demo from the outside: its self-test, its command line, and the
-# daemon as other programs see it (echo clients, snmpget, qorbu-shm, signals).
+# What the demo adds to the library's own tests: its self-test, the daemon
+# as outside programs see it (an echo client, snmpget, qorbu-shm), and a
+# clean stop on SIGTERM and SIGINT.
 # Usage: demo_test.sh CASE QORBU_DEMO QORBU_SHM
 set -u
 CASE=$1 DEMO=$2 TOOL=$3
@@ -70,34 +71,8 @@ case_self_test() {
     [ "$FAILURES" = 0 ] || { echo "--- stderr"; cat "$WORK/err"; }
 }
 
-case_self_test_one_client_and_many() {
-    need_snmpget
-    "$DEMO" --self-test --clients 1 --rounds 1 >"$WORK/out" 2>"$WORK/err" || fail "1 client: exit $?"
-    expect "$WORK/out" 'result +PASS'
-    "$DEMO" --self-test --clients 200 --rounds 4 >"$WORK/out" 2>"$WORK/err" || fail "200 clients: exit $?"
-    expect "$WORK/out" '^  connections +200 of 200 clients connected$'
-    expect "$WORK/out" 'result +PASS'
-}
 
-case_command_line() {
-    "$DEMO" --help >"$WORK/out" 2>&1; [ $? = 0 ] || fail "--help did not exit 0"
-    expect "$WORK/out" '^usage: qorbu-demo'
-    "$DEMO" --bogus >/dev/null 2>"$WORK/err"; [ $? = 2 ] || fail "--bogus did not exit 2"
-    expect "$WORK/err" 'unknown option'
-    "$DEMO" --clients 0 --self-test >/dev/null 2>"$WORK/err"; [ $? = 2 ] || fail "--clients 0 did not exit 2"
-    expect "$WORK/err" '--clients wants a number from 1 to 500'
-    "$DEMO" --port 70000 >/dev/null 2>"$WORK/err"; [ $? = 2 ] || fail "--port 70000 did not exit 2"
-    "$DEMO" --segment-address 0x1234 >/dev/null 2>"$WORK/err"; [ $? = 2 ] || fail "unaligned address did not exit 2"
-    "$DEMO" extra >/dev/null 2>"$WORK/err"; [ $? = 2 ] || fail "a stray argument did not exit 2"
-}
 
-case_existing_segment_is_refused() {
-    "$TOOL" create "$SEGMENT" 4096 >/dev/null || fail "qorbu-shm create"
-    "$DEMO" --port 0 --snmp-port 0 --segment "$SEGMENT" >/dev/null 2>"$WORK/err"
-    [ $? = 1 ] || fail "a daemon on an existing segment did not exit 1"
-    expect "$WORK/err" "segment $SEGMENT already exists"
-    "$TOOL" info "$SEGMENT" >/dev/null || fail "the existing segment was removed"
-}
 
 case_daemon_serves_outside_clients() {
     need_snmpget
@@ -134,22 +109,21 @@ case_daemon_serves_outside_clients() {
     [ "$FAILURES" = 0 ] || { echo "--- stderr"; cat "$WORK/err"; }
 }
 
-# Both signals stop the daemon cleanly, also with a client connected.
-stop_with() {
+# SIGINT stops the daemon cleanly with a client connected (the outside
+# client case stops it with SIGTERM).
+case_sigint_stops_cleanly() {
     start_daemon
     exec 3<>"/dev/tcp/127.0.0.1/$ECHO_PORT" || { fail "cannot connect"; return; }
     printf 'x\n' >&3
     local reply=; read -r -t 10 reply <&3
-    stop_daemon "$1"
-    [ "$DAEMON_STATUS" = 0 ] || fail "exit status $DAEMON_STATUS after SIG$1"
-    expect "$WORK/err" "qorbu-demo: stopping: SIG$1"
+    stop_daemon INT
+    [ "$DAEMON_STATUS" = 0 ] || fail "exit status $DAEMON_STATUS after SIGINT"
+    expect "$WORK/err" "qorbu-demo: stopping: SIGINT"
     expect "$WORK/err" 'qorbu-demo: stopped'
     local rest=; read -r -t 5 rest <&3; [ $? -gt 128 ] && fail "the connection was left open"
     exec 3>&-
     "$TOOL" info "$SEGMENT" >/dev/null 2>&1 && fail "the segment was not unlinked"
 }
-case_sigterm_stops_cleanly() { stop_with TERM; }
-case_sigint_stops_cleanly() { stop_with INT; }
 
 "case_$CASE"
 if [ "$FAILURES" != 0 ]; then

@@ -1,9 +1,9 @@
 #!/bin/bash
 # Builds the Debian packages from a fresh tree configured for /usr, checks
 # their names, dependencies and contents, has lintian check them (any error or
-# warning fails), unpacks them into a scratch root with dpkg -x and builds a
-# small C host against the unpacked files, once with pkg-config and once with
-# find_package(qorbu). Last, the same tree installed under another prefix
+# warning fails), unpacks them into a scratch root with dpkg -x and builds the
+# ABI tests' C host against the unpacked files, once with pkg-config and once
+# with find_package(qorbu). Last, the same tree installed under another prefix
 # runs its programs without LD_LIBRARY_PATH.
 # Usage: packaging_test.sh SOURCE_DIR SCRATCH_DIR
 set -u
@@ -72,7 +72,8 @@ step "a host built with pkg-config"
 export PKG_CONFIG_SYSROOT_DIR=$ROOT PKG_CONFIG_LIBDIR=$LIBDIR/pkgconfig
 [ "$(pkg-config --modversion qorbu)" = "$VERSION" ] || fail "pkg-config version '$(pkg-config --modversion qorbu)'"
 # shellcheck disable=SC2046
-cc -Wall -Wextra -Werror -o "$W/host-pkgconfig" "$SRC/tests/packaging/host/minimal_host.c" \
+cc -std=c11 -pedantic-errors -D_POSIX_C_SOURCE=200809L -Wall -Wextra -Werror -o "$W/host-pkgconfig" \
+    "$SRC/tests/abi/c_host.c" \
     $(pkg-config --cflags --libs qorbu) || fail "the pkg-config build"
 if [ -x "$W/host-pkgconfig" ]; then
     ldd "$W/host-pkgconfig" | grep -q "$LIBDIR/libqorbu.so.5" || fail "the host does not load the unpacked library"
@@ -84,9 +85,7 @@ step "a host built with find_package(qorbu)"
 cmake -S "$SRC/tests/packaging/host" -B "$W/host-cmake" -G Ninja -DCMAKE_PREFIX_PATH="$ROOT/usr" \
     -DCMAKE_C_FLAGS="-Wall -Wextra -Werror" >"$W/host-cmake.log" 2>&1 &&
     cmake --build "$W/host-cmake" >>"$W/host-cmake.log" 2>&1 || { cat "$W/host-cmake.log"; fail "the find_package build"; }
-if [ -x "$W/host-cmake/minimal_host" ]; then
-    "$W/host-cmake/minimal_host" || fail "the find_package host exited $?"
-fi
+[ -x "$W/host-cmake/c_host" ] && { "$W/host-cmake/c_host" || fail "the find_package host exited $?"; }
 
 step "the unpacked tools run"
 "$ROOT/usr/bin/qorbu-shm" --help >/dev/null || fail "qorbu-shm --help"

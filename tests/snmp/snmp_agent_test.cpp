@@ -6,21 +6,11 @@
 #include <net-snmp/net-snmp-includes.h>
 #include <net-snmp/agent/net-snmp-agent-includes.h>
 
-#include <arpa/inet.h>
-#include <gtest/gtest.h>
-#include <netinet/in.h>
-#include <spawn.h>
-#include <sys/socket.h>
-#include <sys/wait.h>
-#include <unistd.h>
-
 #include <cstdlib>
-#include <ctime>
 #include <string>
 
 #include "selector/sel.h"
-
-extern char **environ;
+#include "support/test_support.h"
 
 namespace {
 
@@ -36,19 +26,10 @@ int free_udp_port() {
     addr.sin_family = AF_INET;
     addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
     socklen_t len = sizeof addr;
-    if (bind(s, reinterpret_cast<sockaddr *>(&addr), sizeof addr) != 0 ||
-        getsockname(s, reinterpret_cast<sockaddr *>(&addr), &len) != 0) {
-        close(s);
-        return -1;
-    }
+    const bool bound = bind(s, reinterpret_cast<sockaddr *>(&addr), sizeof addr) == 0 &&
+                       getsockname(s, reinterpret_cast<sockaddr *>(&addr), &len) == 0;
     close(s);
-    return ntohs(addr.sin_port);
-}
-
-double now_sec() {
-    struct timespec t;
-    clock_gettime(CLOCK_MONOTONIC, &t);
-    return static_cast<double>(t.tv_sec) + t.tv_nsec / 1e9;
+    return bound ? ntohs(addr.sin_port) : -1;
 }
 
 struct ClientOutput {
@@ -60,13 +41,9 @@ int collect_output(int fd, unsigned, void *arg, SelFdEntry *) {
     auto *out = static_cast<ClientOutput *>(arg);
     char buf[512];
     const ssize_t n = read(fd, buf, sizeof buf);
-    if (n > 0) {
-        out->text.append(buf, static_cast<size_t>(n));
-        return 0;
-    }
+    if (n > 0) return out->text.append(buf, static_cast<size_t>(n)), 0;
     out->closed = true;
-    SelRemFD(fd);
-    return 0;
+    return SelRemFD(fd), 0;
 }
 
 int g_alarms = 0;
@@ -108,27 +85,6 @@ class NetSnmpAgent : public ::testing::Test {
         (void)!system(cleanup.c_str());
     }
 
-    /* Starts snmpget with its standard output on a pipe; returns the read end. */
-    int start_snmpget(pid_t *pid) {
-        int out[2];
-        if (pipe(out) != 0) return -1;
-        posix_spawn_file_actions_t actions;
-        posix_spawn_file_actions_init(&actions);
-        posix_spawn_file_actions_adddup2(&actions, out[1], STDOUT_FILENO);
-        posix_spawn_file_actions_addclose(&actions, out[0]);
-        const std::string agent = "udp:127.0.0.1:" + std::to_string(port);
-        const char *argv[] = {QORBU_SNMPGET, "-v2c", "-c", "public",      "-On",          "-t",
-                              "5",           "-r",   "2",  agent.c_str(), kScalarOidText, nullptr};
-        const int rc = posix_spawn(pid, QORBU_SNMPGET, &actions, nullptr, const_cast<char **>(argv), environ);
-        posix_spawn_file_actions_destroy(&actions);
-        close(out[1]);
-        if (rc != 0) {
-            close(out[0]);
-            return -1;
-        }
-        return out[0];
-    }
-
     char dir[32] = "/tmp/qorbu-snmp-XXXXXX";
     int port = 0;
     int scalar = kScalarValue;
@@ -140,18 +96,18 @@ TEST_F(NetSnmpAgent, SnmpgetReadsTheScalarAndAnAlarmFiresThroughSelSelect) {
     g_alarms = 0;
     ASSERT_NE(snmp_alarm_register(1, 0, on_alarm, nullptr), 0u);
 
-    pid_t client = -1;
-    const int out = start_snmpget(&client);
-    ASSERT_GE(out, 0);
+    const std::string command = std::string(QORBU_SNMPGET) +
+                                " -v2c -c public -On -t 5 -r 2 udp:127.0.0.1:" + std::to_string(port) + " " +
+                                kScalarOidText;
+    FILE *client = popen(command.c_str(), "r");
+    ASSERT_NE(client, nullptr);
     ClientOutput output;
-    ASSERT_EQ(SelAddFD(out, SEL_READ, 0, collect_output, &output), 0);
+    ASSERT_EQ(SelAddFD(fileno(client), SEL_READ, 0, collect_output, &output), 0);
 
-    const double start = now_sec();
-    while ((!output.closed || g_alarms == 0) && now_sec() - start < kGiveUpAfterSec) SelSelect();
-    close(out);
-    int status = 0;
-    ASSERT_EQ(waitpid(client, &status, 0), client);
-
+    const double start = qorbu::test::seconds_now();
+    while ((!output.closed || g_alarms == 0) && qorbu::test::seconds_now() - start < kGiveUpAfterSec)
+        SelSelect();
+    const int status = pclose(client);
     EXPECT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0) << output.text;
     EXPECT_NE(output.text.find(std::string(kScalarOidText) + " = INTEGER: " + std::to_string(kScalarValue)),
               std::string::npos)
