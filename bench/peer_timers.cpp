@@ -29,9 +29,9 @@ struct QorbuTimers : TimerSet {
         for (long i = 0; i <= n; ++i) t[size_t(i)].callback = qorbu_fire;
         SelGetTime(&base);
     }
-    struct timespec at(long us) {
-        long ns = base.tv_nsec + us % 1000000 * 1000;
-        return {base.tv_sec + us / 1000000 + ns / 1000000000, ns % 1000000000};
+    struct timespec at(long us) { // one division, as a caller holding its times in ns would have it
+        long long ns = base.tv_nsec + us * 1000LL;
+        return {time_t(base.tv_sec + ns / 1000000000), long(ns % 1000000000)};
     }
     void arm(long i, long us) override {
         if (us < kNearSpanUs) SelGetTime(&base); // near deadlines count from now

@@ -71,7 +71,14 @@ static_assert(offsetof(SelContext, pass_count) == 928);
 /* Internal operations, hidden from the library's users but linkable by the
  * white-box tests (they link the static archive of the same objects). */
 /* The calling thread's context: every timer and descriptor call looks it up,
- * so the lookup is inline. */
+ * so the lookup is inline; on x86-64 it calls the C library's lookup through
+ * the GOT, without the PLT stub's extra indirect jump (measured: about 1 ns
+ * of the 17 of an arm and cancel with 100 timers armed). */
+#if defined(__x86_64__) && defined(__has_attribute)
+#if __has_attribute(noplt)
+extern void *pthread_getspecific(pthread_key_t key) __THROW __attribute__((noplt));
+#endif
+#endif
 static inline SelContext *SelCurrentContext(void) { return (SelContext *)pthread_getspecific(sel_tl_key); }
 void SelCreateKey(void);
 void SelFreeContext(void *context);
