@@ -1,208 +1,78 @@
-#include <cerrno>
-#include <fcntl.h>
-#include <unistd.h>
-
-#include <vector>
-
+/* The descriptor registry's bookkeeping, argument checks and the reaper. */
 #include "selector_fixture.h"
 
-using qorbu::test::noop_fd_callback;
-using qorbu::test::SelectorTest;
+using namespace qorbu::test;
 
-namespace {
-
-int tag_a, tag_b;
-
-struct Call {
-    int fd;
-    unsigned event;
-};
-std::vector<Call> calls;
-int record_call(int fd, unsigned event, void *, SelFdEntry *) {
-    calls.push_back({fd, event});
-    return 0;
-}
-
-} // namespace
-
-TEST_F(SelectorTest, AddRefusesBadArguments) {
-    struct Case {
+TEST_F(SelectorTest, InterestSetsAndNfdsFollowRegistrations) {
+    struct Step {
         int fd;
         unsigned events;
-        SelFdCallback callback;
-    } cases[] = {{5, SEL_IN_CALLBACK, noop_fd_callback},
-                 {5, SEL_READ | 16u, noop_fd_callback},
-                 {-1, SEL_READ, noop_fd_callback},
-                 {FD_SETSIZE, SEL_READ, noop_fd_callback},
-                 {5000, 0, noop_fd_callback},
-                 {5, SEL_READ, nullptr}, // nothing to call
-                 {5, 0, nullptr}};
-    for (const Case &c : cases) {
-        errno = 0;
-        EXPECT_EQ(SelAddFD(c.fd, c.events, 0, c.callback, nullptr), -1) << c.fd;
-        EXPECT_EQ(errno, EINVAL) << c.fd;
+        bool remove;
+        int nfds;
+    };
+    const Step steps[] = {{3, SEL_READ, false, 4}, {9, SEL_WRITE | SEL_EXCEPT, false, 10},
+                          {5, 0, false, 10},       {7, SEL_READ | SEL_WRITE | SEL_EXCEPT, false, 10},
+                          {3, 0, true, 10},        {9, 0, true, 8},
+                          {7, 0, true, 1},         {5, SEL_WRITE, false, 6},
+                          {5, 0, true, 1}};
+    unsigned registered[10] = {};
+    for (const Step &s : steps) {
+        SCOPED_TRACE(testing::Message() << "fd " << s.fd << (s.remove ? " removed" : " added"));
+        ASSERT_EQ(s.remove ? SelRemFD(s.fd) : watch(s.fd, s.events, log_fd, &registered[s.fd]), 0);
+        registered[s.fd] = s.remove ? 0 : s.events;
+        EXPECT_EQ(ctx->nfds, s.nfds);
+        EXPECT_EQ(SelGetFDArg(s.fd), s.fd < s.nfds ? &registered[s.fd] : nullptr)
+            << "the last registration's";
+        for (int fd = 0; fd < 10; ++fd) {
+            EXPECT_EQ(FD_ISSET(fd, &ctx->readSet) != 0, (registered[fd] & SEL_READ) != 0) << fd;
+            EXPECT_EQ(FD_ISSET(fd, &ctx->writeSet) != 0, (registered[fd] & SEL_WRITE) != 0) << fd;
+            EXPECT_EQ(FD_ISSET(fd, &ctx->exceptSet) != 0, (registered[fd] & SEL_EXCEPT) != 0) << fd;
+        }
     }
-    // Nothing was written past the fd_set or into the table.
-    EXPECT_EQ(ctx->nfds, 0);
-    EXPECT_LE(ctx->fdTableSize, 6);
-    EXPECT_EQ(SelAddFD(FD_SETSIZE - 1, SEL_READ, 0, noop_fd_callback, nullptr), 0);
-    EXPECT_EQ(ctx->nfds, FD_SETSIZE);
-    EXPECT_TRUE(FD_ISSET(FD_SETSIZE - 1, &ctx->readSet));
 }
 
-TEST_F(SelectorTest, SecondRegistrationIsBusyAndKeepsTheFirst) {
-    ASSERT_EQ(SelAddFD(4, SEL_READ, 0, noop_fd_callback, &tag_a), 0);
-    errno = 0;
-    EXPECT_EQ(SelAddFD(4, SEL_WRITE, 1, record_call, &tag_b), -1);
-    EXPECT_EQ(errno, EBUSY);
-    EXPECT_EQ(ctx->fdTable[4].events, SEL_READ);
-    EXPECT_EQ(ctx->fdTable[4].callback, noop_fd_callback);
-    EXPECT_EQ(SelGetFDArg(4), &tag_a);
-    EXPECT_FALSE(FD_ISSET(4, &ctx->writeSet));
+TEST_F(SelectorTest, BadArgumentsAreRefusedWithTheirErrno) {
+    int arg = 0;
+    ASSERT_EQ(watch(3, SEL_READ, log_fd, &arg), 0);
+    ASSERT_EQ(SelAddSignal(SIGUSR1), 0);
+    const std::pair<Outcome, Outcome> cases[] = {
+        {OUTCOME(SelAddFD(5, SEL_IN_CALLBACK, 0, log_fd, nullptr)), failure(EINVAL)},
+        {OUTCOME(SelAddFD(-1, SEL_READ, 0, log_fd, nullptr)), failure(EINVAL)},
+        {OUTCOME(SelAddFD(3, SEL_WRITE, 0, log_fd, nullptr)), failure(EBUSY)},
+        {OUTCOME(SelRemFD(4)), failure(EINVAL)},
+        {OUTCOME(SelRemFD(-1)), failure(EINVAL)},
+        {OUTCOME(SelGetFDArg(4) == nullptr), Outcome(1, EINVAL)},
+        {OUTCOME(SelGetFDArg(3) == &arg), Outcome(1, 0)},
+        {OUTCOME(SelAddSignal(0)), failure(EINVAL)},
+        {OUTCOME(SelAddSignal(65)), failure(EINVAL)},
+        {OUTCOME(SelAddSignal(SIGUSR1)), failure(EINVAL)},
+        {OUTCOME(SelRemSignal(SIGUSR2)), failure(EINVAL)},
+        {OUTCOME(SelRemSignal(SIGUSR1)), Outcome(0, 0)},
+        {OUTCOME(SelRemSignal(SIGUSR1)), failure(EINVAL)},
+    };
+    for (size_t i = 0; i < std::size(cases); ++i) EXPECT_EQ(cases[i].first, cases[i].second) << "case " << i;
+    EXPECT_FALSE(blocked(SIGUSR1));
 }
 
-TEST_F(SelectorTest, EmptyMaskStoresButLeavesSlotFree) {
-    ASSERT_EQ(SelAddFD(3, SEL_READ, 0, noop_fd_callback, nullptr), 0);
-    ASSERT_EQ(SelAddFD(7, 0, 0, noop_fd_callback, &tag_a), 0);
-    EXPECT_EQ(ctx->nfds, 4);
-    EXPECT_EQ(ctx->fdTable[7].events, 0u);
-    EXPECT_EQ(ctx->fdTable[7].arg, &tag_a);
-    EXPECT_EQ(SelAddFD(7, SEL_WRITE, 0, noop_fd_callback, nullptr), 0); // still free
-}
+TEST_F(SelectorTest, ReaperClosesTrackedReadDescriptorsIdleForMoreThan25Seconds) {
+    timespec soon;
+    SelMakeWhen(&soon, 29, 0);
+    EXPECT_TRUE(fd_timer.heapIndex != 0 && soon.tv_sec <= fd_timer.when.tv_sec)
+        << "armed 30 s ahead by SelInit";
+    Pipe idle26, idle25, untracked, write_only;
+    for (int fd : {idle26.r, idle25.r}) ASSERT_EQ(SelAddFD(fd, SEL_READ, 1, log_fd, nullptr), 0);
+    ASSERT_EQ(SelAddFD(untracked.r, SEL_READ, 0, log_fd, nullptr), 0);
+    ASSERT_EQ(SelAddFD(write_only.w, SEL_WRITE, 1, log_fd, nullptr), 0);
+    for (auto [fd, idle] : {std::pair{idle26.r, 26}, {idle25.r, 25}, {untracked.r, 60}, {write_only.w, 60}})
+        ctx->fdTable[fd].lastActivity.tv_sec -= idle;
 
-TEST_F(SelectorTest, NfdsFollowsTheHighestRegistration) {
-    ASSERT_EQ(SelAddFD(3, SEL_READ, 0, noop_fd_callback, &tag_a), 0);
-    ASSERT_EQ(SelAddFD(9, SEL_EXCEPT, 0, noop_fd_callback, &tag_b), 0);
-    EXPECT_EQ(ctx->nfds, 10);
-    EXPECT_EQ(ctx->fdTableSize, 10); // exactly one past the highest asked for
-
-    EXPECT_EQ(SelRemFD(9), 0);
-    EXPECT_EQ(ctx->nfds, 4);
-    EXPECT_FALSE(FD_ISSET(9, &ctx->exceptSet));
-    errno = 0;
-    EXPECT_EQ(SelRemFD(9), -1);
-    EXPECT_EQ(errno, EINVAL);
-    EXPECT_EQ(SelGetFDArg(9), nullptr);
-    EXPECT_EQ(errno, EINVAL);
-
-    EXPECT_EQ(SelRemFD(2), 0); // below nfds, never registered
-    EXPECT_EQ(SelGetFDArg(3), &tag_a);
-    EXPECT_EQ(SelRemFD(3), 0);
-    EXPECT_EQ(ctx->nfds, 1);
-    EXPECT_EQ(SelGetFDArg(0), nullptr);
-    errno = 0;
-    EXPECT_EQ(SelRemFD(-1), -1);
-    EXPECT_EQ(errno, EINVAL);
-}
-
-TEST_F(SelectorTest, RemovedDescriptorKeepsItsLastArgument) {
-    ASSERT_EQ(SelAddFD(5, SEL_READ, 0, noop_fd_callback, &tag_a), 0);
-    ASSERT_EQ(SelAddFD(8, SEL_READ, 0, noop_fd_callback, nullptr), 0);
-    ASSERT_EQ(SelRemFD(5), 0);
-    EXPECT_EQ(SelGetFDArg(5), &tag_a);
-}
-
-TEST_F(SelectorTest, TableGrowsAndKeepsEntries) {
-    ASSERT_EQ(SelAddFD(2, SEL_READ, 0, noop_fd_callback, &tag_a), 0);
-    for (int fd = 10; fd < 1000; fd += 37) ASSERT_EQ(SelAddFD(fd, SEL_WRITE, 0, noop_fd_callback, &tag_b), 0);
-    EXPECT_EQ(ctx->fdTableSize, 973); // 10 + 37 * 26 is the highest
-    EXPECT_EQ(ctx->fdTable[2].arg, &tag_a);
-    EXPECT_EQ(ctx->fdTable[2].events, SEL_READ);
-    EXPECT_EQ(ctx->fdTable[500].events, 0u);
-}
-
-TEST_F(SelectorTest, IdleTrackingStampsOnlyWhenOne) {
-    ASSERT_EQ(SelAddFD(3, SEL_READ, 1, noop_fd_callback, nullptr), 0);
-    ASSERT_EQ(SelAddFD(4, SEL_READ, 0, noop_fd_callback, nullptr), 0);
-    EXPECT_NE(ctx->fdTable[3].lastActivity.tv_sec, 0);
-    EXPECT_EQ(ctx->fdTable[4].lastActivity.tv_sec, 0);
-
-    ctx->fdTable[3].lastActivity.tv_sec = 1;
-    SelDispatchFD(ctx, 3, SEL_READ);
-    SelDispatchFD(ctx, 4, SEL_READ);
-    EXPECT_GT(ctx->fdTable[3].lastActivity.tv_sec, 1);
-    EXPECT_EQ(ctx->fdTable[4].lastActivity.tv_sec, 0);
-}
-
-// The guard around a running callback.
-namespace {
-
-SelContext *guard_ctx = nullptr;
-int add_again_result = 0, add_again_errno = 0;
-bool was_in_callback = false;
-bool interest_lifted = false;
-
-int try_add_again(int fd, unsigned, void *, SelFdEntry *entry) {
-    was_in_callback = (entry->events & SEL_IN_CALLBACK) != 0;
-    interest_lifted = !FD_ISSET(fd, &guard_ctx->readSet) && !FD_ISSET(fd, &guard_ctx->writeSet);
-    errno = 0;
-    add_again_result = SelAddFD(fd, SEL_READ, 0, noop_fd_callback, nullptr);
-    add_again_errno = errno;
-    return 0;
-}
-
-int remove_self(int fd, unsigned, void *, SelFdEntry *) { return SelRemFD(fd); }
-
-int reregister_for_write(int fd, unsigned, void *, SelFdEntry *) {
-    SelRemFD(fd);
-    // Registering a far descriptor moves the table under the running dispatch.
-    SelAddFD(900, SEL_READ, 0, noop_fd_callback, nullptr);
-    return SelAddFD(fd, SEL_WRITE, 0, noop_fd_callback, nullptr);
-}
-
-int remove_other(int, unsigned, void *arg, SelFdEntry *) { return SelRemFD(*static_cast<int *>(arg)); }
-
-} // namespace
-
-TEST_F(SelectorTest, GuardRestoresInterestAfterTheCallback) {
-    guard_ctx = ctx;
-    ASSERT_EQ(SelAddFD(6, SEL_READ | SEL_WRITE, 0, try_add_again, nullptr), 0);
-    SelDispatchFD(ctx, 6, SEL_READ);
-    EXPECT_TRUE(was_in_callback);
-    EXPECT_TRUE(interest_lifted);
-    EXPECT_EQ(add_again_result, -1);
-    EXPECT_EQ(add_again_errno, EBUSY);
-    EXPECT_EQ(ctx->fdTable[6].events, SEL_READ | SEL_WRITE);
-    EXPECT_TRUE(FD_ISSET(6, &ctx->readSet));
-    EXPECT_TRUE(FD_ISSET(6, &ctx->writeSet));
-}
-
-TEST_F(SelectorTest, CallbackRemovingItselfLeavesNoInterest) {
-    ASSERT_EQ(SelAddFD(6, SEL_READ | SEL_EXCEPT, 0, remove_self, nullptr), 0);
-    SelDispatchFD(ctx, 6, SEL_READ);
-    EXPECT_EQ(ctx->fdTable[6].events, 0u);
-    EXPECT_FALSE(FD_ISSET(6, &ctx->readSet));
-    EXPECT_FALSE(FD_ISSET(6, &ctx->exceptSet));
-    EXPECT_EQ(ctx->nfds, 1);
-}
-
-TEST_F(SelectorTest, CallbackReregisteringKeepsOnlyTheNewMask) {
-    ASSERT_EQ(SelAddFD(6, SEL_READ, 0, reregister_for_write, nullptr), 0);
-    SelDispatchFD(ctx, 6, SEL_READ);
-    EXPECT_EQ(ctx->fdTable[6].events, SEL_WRITE);
-    EXPECT_FALSE(FD_ISSET(6, &ctx->readSet));
-    EXPECT_TRUE(FD_ISSET(6, &ctx->writeSet));
-    EXPECT_EQ(ctx->fdTableSize, 901);
-}
-
-TEST_F(SelectorTest, CallbackRemovingAnotherClearsItsReadyBits) {
-    int other = 8;
-    ASSERT_EQ(SelAddFD(5, SEL_READ, 0, remove_other, &other), 0);
-    ASSERT_EQ(SelAddFD(8, SEL_READ | SEL_WRITE, 0, noop_fd_callback, nullptr), 0);
-    FD_SET(8, &ctx->readyRead);
-    FD_SET(8, &ctx->readyWrite);
-    SelDispatchFD(ctx, 5, SEL_READ);
-    EXPECT_FALSE(FD_ISSET(8, &ctx->readyRead));
-    EXPECT_FALSE(FD_ISSET(8, &ctx->readyWrite));
-    EXPECT_FALSE(FD_ISSET(8, &ctx->readSet));
-    EXPECT_EQ(ctx->nfds, 6);
-}
-
-TEST_F(SelectorTest, DispatchPassesTheEntryAndEvent) {
-    calls.clear();
-    ASSERT_EQ(SelAddFD(3, SEL_EXCEPT, 0, record_call, nullptr), 0);
-    SelDispatchFD(ctx, 3, SEL_EXCEPT);
-    ASSERT_EQ(calls.size(), 1u);
-    EXPECT_EQ(calls[0].fd, 3);
-    EXPECT_EQ(calls[0].event, SEL_EXCEPT);
+    const timespec due = {0, 0};
+    ASSERT_EQ(SelModifyTimer(&fd_timer, &due), 0);
+    EXPECT_EQ(SelRunTimers(ctx), 1);
+    EXPECT_EQ(OUTCOME(fcntl(idle26.r, F_GETFD)), failure(EBADF));
+    EXPECT_FALSE(FD_ISSET(idle26.r, &ctx->readSet));
+    idle26.r = -1;
+    for (int fd : {idle25.r, untracked.r, write_only.w}) EXPECT_NE(fcntl(fd, F_GETFD), -1) << fd;
+    EXPECT_TRUE(fd_timer.heapIndex != 0 && soon.tv_sec <= fd_timer.when.tv_sec) << "re-armed 30 s ahead";
+    EXPECT_TRUE(host.log.empty());
 }
