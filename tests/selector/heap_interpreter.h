@@ -1,12 +1,13 @@
 /* Drives the calling thread's timer heap with operations decoded from bytes
- * and compares it, after every step and inside every expiry callback, with a
+ * and compares it, after every step and in every expiry callback, with a
  * reference binary heap of the same records: 1-based, slot 0 unused, a timer
- * moves only past a strictly earlier or later neighbour, and on equal
- * children the right one goes up. Used by the seeded test and the fuzzer. */
+ * moves only past a strictly earlier or later neighbour, and of two equal
+ * children the right one goes up. Shared by the seeded test and the fuzzer. */
 #ifndef QORBU_TESTS_SELECTOR_HEAP_INTERPRETER_H
 #define QORBU_TESTS_SELECTOR_HEAP_INTERPRETER_H
 
 #include <cstddef>
+#include <csignal>
 #include <cstdint>
 #include <string>
 #include <vector>
@@ -17,24 +18,23 @@ namespace qorbu::test {
 
 class HeapInterpreter {
   public:
-    static constexpr int kRecords = 24;
-    static constexpr int kRunLimit = 101;
+    static constexpr int kRecords = 24, kRunLimit = 101;
 
     /* Empties the heap, then runs one operation per three bytes (operation,
      * record, parameter). Returns "" or the first difference found. */
     std::string run(const uint8_t *data, size_t size) {
         ctx_ = SelCurrentContext();
         SelRemoveAllTimers();
-        model_.assign(1, nullptr);
-        error_.clear();
+        sigset_t quit; /* raised by a refused SelAddTimer */
+        sigemptyset(&quit), sigaddset(&quit, SIGQUIT), pthread_sigmask(SIG_BLOCK, &quit, nullptr);
+        model_.assign(1, nullptr), error_.clear();
         timespec now;
         SelGetTime(&now);
         past_ = now.tv_sec - 100, future_ = now.tv_sec + 100000;
         for (SelTimer &t : records_) t = SelTimer{0, {}, fire, this};
-        for (size_t i = 0; i + 3 <= size && error_.empty(); i += 3) {
-            step_ = i / 3;
-            apply(data[i] % 8, records_[data[i + 1] % kRecords], data[i + 2]);
-            check();
+        for (step_ = 0; 3 * step_ + 3 <= size && error_.empty(); ++step_, check()) {
+            const uint8_t *op = data + 3 * step_;
+            apply(op[0] % 8, records_[op[1] % kRecords], op[2]);
         }
         return error_;
     }
@@ -45,8 +45,8 @@ class HeapInterpreter {
     }
     static bool earlier(const SelTimer *a, const SelTimer *b) { return earlier(a->when, b->when); }
 
-    /* Few distinct values, so that equal deadlines are common: negative,
-     * past and future seconds, each with four nanosecond values. */
+    /* Few values, so that equal deadlines are common: negative, past and
+     * future seconds, each with four nanosecond values. */
     timespec deadline(uint8_t p) const {
         static constexpr long kNsec[] = {0, 1, 500000000, 999999999};
         const time_t base = (p & 0x30) == 0 ? -2 : (p & 0x30) == 0x10 ? past_ : future_;
@@ -54,77 +54,58 @@ class HeapInterpreter {
     }
 
     void apply(int op, SelTimer &t, uint8_t p) {
-        const timespec old = t.when;
-        switch (op) {
-        case 0:
-        case 1:
+        const timespec old = t.when, when = deadline(p);
+        if (op <= 1) { /* arms a free record; an armed one, or one without a callback, is refused */
+            if (SelAddTimer(t.heapIndex != 0 ? &t : &unusable_) != -117) return fail("misuse accepted");
             if (t.heapIndex != 0) return;
-            t.when = deadline(p);
-            if (SelAddTimer(&t) != 0) return fail("SelAddTimer failed");
-            return add(&t);
-        case 2: SelRemTimer(&t); return remove(&t);
-        case 3: {
-            const timespec when = deadline(p);
-            if (SelModifyTimer(&t, &when) != 0) return fail("SelModifyTimer failed");
-            return modify(&t, old);
+            t.when = when;
+            return SelAddTimer(&t) == 0 ? add(&t) : fail("SelAddTimer failed");
         }
-        case 4: return sleep(t, p & 1 ? 0u : 3600000u + p * 7919u, old);
-        case 5: return expire(p & 0x80 ? p & 0x7f : 0);
-        case 6:
-            if (SelDebugIsTimerActive(&t) != (slot_of(&t) != 0)) fail("SelDebugIsTimerActive");
-            return;
-        default:
-            if (p >= 32) return SelRemTimer(&t), remove(&t);
-            if (SelRemoveAllTimers() != static_cast<int>(model_.size()) - 1) fail("SelRemoveAllTimers count");
-            model_.resize(1);
-        }
+        if (op == 2 || (op == 7 && p >= 32)) return SelRemTimer(&t), remove(&t);
+        if (op == 3) return SelModifyTimer(&t, &when) == 0 ? modify(&t, old) : fail("SelModifyTimer failed");
+        if (op == 4) return sleep(t, p & 1 ? 0u : 3600000u + p * 7919u, old);
+        if (op == 5) return expire(p & 0x80 ? p & 0x7f : 0);
+        if (op == 6 && SelDebugIsTimerActive(&t) != (slot_of(&t) != 0)) return fail("SelDebugIsTimerActive");
+        if (op == 7 && SelRemoveAllTimers() + 1 != static_cast<int>(model_.size())) fail("RemoveAll");
+        if (op == 7) model_.resize(1);
     }
 
     void sleep(SelTimer &t, unsigned ms, const timespec &old) {
+        const auto ns = [](const timespec &w) { return w.tv_sec * 1000000000LL + w.tv_nsec; };
+        const long long span = ms * 1000000LL;
         timespec lo, hi;
         SelGetTime(&lo);
-        if (SelSleep(&t, ms) != 0) return fail("SelSleep failed");
+        const int result = SelSleep(&t, ms);
         SelGetTime(&hi);
-        for (timespec *bound : {&lo, &hi}) {
-            bound->tv_sec += ms / 1000;
-            bound->tv_nsec += ms % 1000 * 1000000L;
-            if (bound->tv_nsec > 999999999) bound->tv_sec++, bound->tv_nsec -= 1000000000;
-        }
-        if (t.when.tv_nsec < 0 || t.when.tv_nsec > 999999999 || earlier(t.when, lo) || earlier(hi, t.when))
-            return fail("SelSleep deadline");
+        if (result != 0 || t.when.tv_nsec < 0 || t.when.tv_nsec > 999999999 || ns(t.when) < ns(lo) + span ||
+            ns(t.when) > ns(hi) + span)
+            return fail("SelSleep");
         modify(&t, old);
     }
 
     /* One expiry run; each fired timer re-arms itself for the present while
      * the budget lasts, so that the run's limit is reached now and then. */
     void expire(int budget) {
-        budget_ = budget;
-        fired_ = 0;
+        budget_ = budget, fired_ = 0;
         const int fired = SelRunTimers(ctx_);
         timespec now;
         SelGetTime(&now);
         if (fired != fired_ || fired > kRunLimit) fail("expiry run count");
         if (fired < kRunLimit && model_.size() > 1 && !earlier(now, model_[1]->when))
-            fail("a due timer was not fired");
+            fail("a due timer left");
     }
-
-    static int fire(SelTimer *t) {
-        static_cast<HeapInterpreter *>(t->arg)->fired(t);
-        return 0;
-    }
+    static int fire(SelTimer *t) { return static_cast<HeapInterpreter *>(t->arg)->fired(t), 0; }
     void fired(SelTimer *t) {
         ++fired_;
         if (ctx_->timerHeap[0] != t || t->heapIndex != 0) fail("fired timer not parked in slot 0, disarmed");
         if (model_.size() < 2 || model_[1] != t) return fail("fired out of order");
-        remove(t);
-        check();
-        if (budget_ > 0 && budget_--) {
-            if (SelSleep(t, 0) != 0) fail("re-arming in the callback failed");
-            add(t);
-        }
+        remove(t), check();
+        if (budget_-- <= 0) return;
+        if (SelSleep(t, 0) != 0) fail("re-arming in the callback failed");
+        add(t);
     }
 
-    /* --- the reference heap -------------------------------------------------- */
+    /* The reference heap. */
     size_t slot_of(const SelTimer *t) const {
         for (size_t i = 1; i < model_.size(); ++i)
             if (model_[i] == t) return i;
@@ -137,9 +118,8 @@ class HeapInterpreter {
     }
     void down(size_t i) {
         SelTimer *t = model_[i];
-        const size_t n = model_.size() - 1;
-        for (size_t l = 2 * i, c; l <= n; i = c, l = 2 * i) {
-            if (l + 1 <= n && (earlier(model_[l], t) || earlier(model_[l + 1], t)))
+        for (size_t l = 2 * i, n = model_.size() - 1, c; l <= n; i = c, l = 2 * i) {
+            if (l < n && (earlier(model_[l], t) || earlier(model_[l + 1], t)))
                 c = earlier(model_[l], model_[l + 1]) ? l : l + 1;
             else if (earlier(model_[l], t))
                 c = l;
@@ -149,16 +129,11 @@ class HeapInterpreter {
         }
         model_[i] = t;
     }
-    void add(SelTimer *t) {
-        model_.push_back(t);
-        up(model_.size() - 1);
-    }
+    void add(SelTimer *t) { model_.push_back(t), up(model_.size() - 1); }
     void remove(SelTimer *t) {
         const size_t i = slot_of(t);
-        if (i == 0) return;
         SelTimer *last = model_.back();
-        model_.pop_back();
-        if (i == model_.size()) return;
+        if (i == 0 || (model_.pop_back(), i == model_.size())) return;
         model_[i] = last;
         i > 1 && earlier(last, model_[i / 2]) ? up(i) : down(i);
     }
@@ -183,7 +158,7 @@ class HeapInterpreter {
     }
 
     SelContext *ctx_ = nullptr;
-    SelTimer records_[kRecords]{};
+    SelTimer records_[kRecords]{}, unusable_{};
     std::vector<SelTimer *> model_;
     time_t past_ = 0, future_ = 0;
     int budget_ = 0, fired_ = 0;
