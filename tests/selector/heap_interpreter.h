@@ -6,9 +6,7 @@
 #ifndef QORBU_TESTS_SELECTOR_HEAP_INTERPRETER_H
 #define QORBU_TESTS_SELECTOR_HEAP_INTERPRETER_H
 
-#include <cstddef>
 #include <csignal>
-#include <cstdint>
 #include <string>
 #include <vector>
 
@@ -18,8 +16,6 @@ namespace qorbu::test {
 
 class HeapInterpreter {
   public:
-    static constexpr int kRecords = 24, kRunLimit = 101;
-
     /* Empties the heap, then runs one operation per three bytes (operation,
      * record, parameter). Returns "" or the first difference found. */
     std::string run(const uint8_t *data, size_t size) {
@@ -32,10 +28,9 @@ class HeapInterpreter {
         SelGetTime(&now);
         past_ = now.tv_sec - 100, future_ = now.tv_sec + 100000;
         for (SelTimer &t : records_) t = SelTimer{0, {}, fire, this};
-        for (step_ = 0; 3 * step_ + 3 <= size && error_.empty(); ++step_, check()) {
-            const uint8_t *op = data + 3 * step_;
-            apply(op[0] % 8, records_[op[1] % kRecords], op[2]);
-        }
+        for (step_ = 0; 3 * step_ + 3 <= size && error_.empty(); ++step_, check())
+            apply(data[3 * step_] % 8, records_[data[3 * step_ + 1] % std::size(records_)],
+                  data[3 * step_ + 2]);
         return error_;
     }
 
@@ -44,17 +39,13 @@ class HeapInterpreter {
         return a.tv_sec < b.tv_sec || (a.tv_sec == b.tv_sec && a.tv_nsec < b.tv_nsec);
     }
     static bool earlier(const SelTimer *a, const SelTimer *b) { return earlier(a->when, b->when); }
-
-    /* Few values, so that equal deadlines are common: negative, past and
-     * future seconds, each with four nanosecond values. */
-    timespec deadline(uint8_t p) const {
+    static long long ns(const timespec &w) { return w.tv_sec * 1000000000LL + w.tv_nsec; }
+    void apply(int op, SelTimer &t, uint8_t p) {
+        /* Few deadlines, so that equal ones are common: negative, past and
+         * future seconds, each with four nanosecond values. */
         static constexpr long kNsec[] = {0, 1, 500000000, 999999999};
         const time_t base = (p & 0x30) == 0 ? -2 : (p & 0x30) == 0x10 ? past_ : future_;
-        return {static_cast<time_t>(base + ((p >> 2) & 3)), kNsec[p & 3]};
-    }
-
-    void apply(int op, SelTimer &t, uint8_t p) {
-        const timespec old = t.when, when = deadline(p);
+        const timespec old = t.when, when = {static_cast<time_t>(base + ((p >> 2) & 3)), kNsec[p & 3]};
         if (op <= 1) { /* arms a free record; an armed one, or one without a callback, is refused */
             if (SelAddTimer(t.heapIndex != 0 ? &t : &unusable_) != -117) return fail("misuse accepted");
             if (t.heapIndex != 0) return;
@@ -63,36 +54,30 @@ class HeapInterpreter {
         }
         if (op == 2 || (op == 7 && p >= 32)) return SelRemTimer(&t), remove(&t);
         if (op == 3) return SelModifyTimer(&t, &when) == 0 ? modify(&t, old) : fail("SelModifyTimer failed");
-        if (op == 4) return sleep(t, p & 1 ? 0u : 3600000u + p * 7919u, old);
         if (op == 5) return expire(p & 0x80 ? p & 0x7f : 0);
         if (op == 6 && SelDebugIsTimerActive(&t) != (slot_of(&t) != 0)) return fail("SelDebugIsTimerActive");
         if (op == 7 && SelRemoveAllTimers() + 1 != static_cast<int>(model_.size())) fail("RemoveAll");
         if (op == 7) model_.resize(1);
-    }
-
-    void sleep(SelTimer &t, unsigned ms, const timespec &old) {
-        const auto ns = [](const timespec &w) { return w.tv_sec * 1000000000LL + w.tv_nsec; };
-        const long long span = ms * 1000000LL;
+        if (op != 4) return;
+        const unsigned ms = p & 1 ? 0u : 3600000u + p * 7919u; /* due at once, or in an hour or more */
         timespec lo, hi;
         SelGetTime(&lo);
         const int result = SelSleep(&t, ms);
         SelGetTime(&hi);
-        if (result != 0 || t.when.tv_nsec < 0 || t.when.tv_nsec > 999999999 || ns(t.when) < ns(lo) + span ||
-            ns(t.when) > ns(hi) + span)
+        if (result != 0 || t.when.tv_nsec < 0 || t.when.tv_nsec > 999999999 ||
+            ns(t.when) < ns(lo) + ms * 1000000LL || ns(t.when) > ns(hi) + ms * 1000000LL)
             return fail("SelSleep");
         modify(&t, old);
     }
-
     /* One expiry run; each fired timer re-arms itself for the present while
-     * the budget lasts, so that the run's limit is reached now and then. */
+     * the budget lasts, so that the run's limit of 101 is reached now and then. */
     void expire(int budget) {
         budget_ = budget, fired_ = 0;
         const int fired = SelRunTimers(ctx_);
         timespec now;
         SelGetTime(&now);
-        if (fired != fired_ || fired > kRunLimit) fail("expiry run count");
-        if (fired < kRunLimit && model_.size() > 1 && !earlier(now, model_[1]->when))
-            fail("a due timer left");
+        if (fired != fired_ || fired > 101) fail("expiry run count");
+        if (fired < 101 && model_.size() > 1 && !earlier(now, model_[1]->when)) fail("a due timer left");
     }
     static int fire(SelTimer *t) { return static_cast<HeapInterpreter *>(t->arg)->fired(t), 0; }
     void fired(SelTimer *t) {
@@ -104,7 +89,6 @@ class HeapInterpreter {
         if (SelSleep(t, 0) != 0) fail("re-arming in the callback failed");
         add(t);
     }
-
     /* The reference heap. */
     size_t slot_of(const SelTimer *t) const {
         for (size_t i = 1; i < model_.size(); ++i)
@@ -142,7 +126,6 @@ class HeapInterpreter {
         if (i == 0) return add(t);
         earlier(old, t->when) ? down(i) : up(i);
     }
-
     void check() {
         const int n = static_cast<int>(model_.size()) - 1;
         if (ctx_->timerCount != n || n > ctx_->timerCapacity) return fail("timerCount or timerCapacity");
@@ -158,7 +141,7 @@ class HeapInterpreter {
     }
 
     SelContext *ctx_ = nullptr;
-    SelTimer records_[kRecords]{}, unusable_{};
+    SelTimer records_[24]{}, unusable_{};
     std::vector<SelTimer *> model_;
     time_t past_ = 0, future_ = 0;
     int budget_ = 0, fired_ = 0;

@@ -17,17 +17,12 @@ int thread_fetch_queued(void *hostContext, void *task) {
 }
 int thread_call(void *) { return host.log.push_back("task"), 0; }
 int thread_select_nb(void *) { return host.log.push_back("nb"), host.queued += host.queued_by_select_nb, 0; }
-int timeval_cmp(struct timeval a, struct timeval b) {
-    return a.tv_sec != b.tv_sec ? (a.tv_sec > b.tv_sec) - (a.tv_sec < b.tv_sec)
-                                : (a.tv_usec > b.tv_usec) - (a.tv_usec < b.tv_usec);
-}
+int timeval_cmp(timeval a, timeval b) { return timercmp(&a, &b, <) ? -1 : timercmp(&a, &b, >); }
 struct timeval timeval_sub(struct timeval a, struct timeval b) {
     const long usec = a.tv_usec - b.tv_usec;
     return usec < 0 ? timeval{a.tv_sec - b.tv_sec - 1, usec + 1000000} : timeval{a.tv_sec - b.tv_sec, usec};
 }
-int pal_time_tzcurrent(struct timeval *now, void *) {
-    return host.log.push_back("clock"), *now = host.now, 0;
-}
+int pal_time_tzcurrent(timeval *now, void *) { return host.log.push_back("clock"), *now = host.now, 0; }
 int snmp_select_info(int *count, fd_set *set, struct timeval *timeout, int *block) {
     host.log.push_back("info");
     for (int fd = 0; fd < host.snmp_count; ++fd)

@@ -28,7 +28,6 @@ struct ScriptedHost {
     void due(int list, timeval when) { scheduler.timed[list] = &(tasks[list] = {nullptr, when}); }
 };
 extern ScriptedHost host;
-
 /* Logs "<fd>:r", "<fd>:w" or "<fd>:x". */
 inline int log_fd(int fd, unsigned event, void *, SelFdEntry *) {
     return host.log.push_back(std::to_string(fd) + ':' + "?rw?x???"[event & 7]), 0;
@@ -39,14 +38,15 @@ inline std::string logged() {
     for (const std::string &entry : host.log) out += (out.empty() ? "" : " ") + entry;
     return out;
 }
+inline int watch(int fd, unsigned events = SEL_READ, SelFdCallback cb = log_fd, void *arg = nullptr) {
+    return SelAddFD(fd, events, 0, cb, arg);
+}
 inline int log_timer(SelTimer *) { return host.log.push_back("timer"), 0; }
-
 inline volatile sig_atomic_t handled[65];
 inline bool blocked(int signo) {
     sigset_t mask;
     return sigprocmask(SIG_BLOCK, nullptr, &mask) == 0 && sigismember(&mask, signo) == 1;
 }
-
 /* Runs body in a child process, so that a call that ends the process or never
  * returns fails an assertion here; the child's own checks print as usual. */
 template <typename Body>
@@ -62,10 +62,6 @@ class SelectorTest : public ::testing::Test {
         host.context.scheduler = &host.scheduler;
         ASSERT_EQ(SelInit(), 0);
         ASSERT_NE(ctx = SelCurrentContext(), nullptr);
-    }
-    static int watch(int fd, unsigned events = SEL_READ, SelFdCallback callback = log_fd,
-                     void *arg = nullptr) {
-        return SelAddFD(fd, events, 0, callback, arg);
     }
     /* Ends a wait that nothing else would end: the guard timer logs "timer". */
     void bound_wait(unsigned ms) {
