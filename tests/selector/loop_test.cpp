@@ -64,7 +64,7 @@ TEST_F(SelectorTest, WaitEndsAtTheEarliestTimeoutAndOnlyAnSnmpOneServicesSnmp) {
     SelSetZG(&host.context);
     const std::string waited = "drained info drained clock info nb drained",
                       no_host = "drained info drained info ";
-    /* host task due, SNMP time-out, timer; a tie leaves the host's chosen, an overdue task waits for nothing */
+    /* host task due, SNMP time-out, timer; a tie keeps the host's, an overdue task waits for nothing */
     using Case = std::tuple<timeval, timeval, unsigned, std::string>;
     for (auto [due, snmp, timer_ms, log] :
          {Case{{1000, 40000}, {0, 40000}, 0, waited},
@@ -108,7 +108,7 @@ TEST_F(SelectorTest, ExceptionalConditionFirstThenReadBeforeWriteThenRoundRobin)
 }
 
 TEST_F(SelectorTest, CallbacksChangeRegistrationsDuringThePass) {
-    /* what 40's callback does (a nested pass: 40 is skipped, the outer pass stops), the callbacks, 40's interest */
+    /* what 40's callback does (Nest: 40 is skipped, the outer pass stops), the callbacks, 40's interest */
     using Case = std::tuple<Act, const char *, bool, bool>;
     for (auto [what, log, reads, writes] :
          {Case{Keep, "40:r 42:r", true, false}, Case{AddSelf, "40:r 42:r", true, false},
