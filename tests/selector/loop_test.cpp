@@ -54,10 +54,13 @@ TEST_F(SelectorTest, ReadyDescriptorIsServedAfterThePollThenTimersThenTheHost) {
     EXPECT_EQ(SelSelect(), 0);
     EXPECT_EQ(logged(), "task drained info 40:r timer nb task drained");
     ASSERT_EQ(SelRemFD(p.r), 0);
-    bound_wait(0);
-    host.log.clear();
+    bound_wait(0), host.log.clear();
     EXPECT_EQ(SelSelect(), 0);
     EXPECT_EQ(logged(), "drained info timer") << "a due timer ends the pass";
+    SelHostContext no_scheduler{nullptr};
+    SelSetZG(&no_scheduler), bound_wait(0), host.log.clear();
+    EXPECT_EQ(SelSelect(), 0);
+    EXPECT_EQ(logged(), "info timer") << "host hooks stay off without a host scheduler";
 }
 
 TEST_F(SelectorTest, WaitEndsAtTheEarliestTimeoutAndOnlyAnSnmpOneServicesSnmp) {
@@ -164,10 +167,9 @@ TEST_F(SelectorTest, HostAndSnmpDescriptorsWidenTheWait) {
     qorbu::sel::sel_einval_count = 3;
     EXPECT_EQ(SelSelect(), 0);
     EXPECT_EQ(qorbu::sel::sel_einval_count, 0) << "the ready pair of the host's 60 was not left over";
-    host.scheduler.max_fd = 59, host.snmp_count = 61;
+    host.scheduler.max_fd = 59, host.snmp_count = 61, host.log.clear();
     FD_SET(60, &host.snmp_set);
     bound_wait(1000);
-    host.log.clear();
     EXPECT_EQ(SelSelect(), 0);
     EXPECT_EQ(logged(), "drained info nb drained snmp_read");
 }
@@ -210,8 +212,7 @@ TEST_F(SelectorTest, EpollGivesEachReadyDescriptorOneEventBitThenRunsTimers) {
     SocketPair wants_write, wants_both; /* fd[0] of each: readable and writable */
     Pipe idle, data_hangup, hangup, broken;
     for (int fd : {wants_write.fd[1], wants_both.fd[1], data_hangup.w}) ASSERT_EQ(write(fd, "x", 1), 1);
-    close(data_hangup.w), close(hangup.w), close(broken.r);
-    data_hangup.w = hangup.w = broken.r = -1;
+    close(data_hangup.w), close(hangup.w), close(broken.r), data_hangup.w = hangup.w = broken.r = -1;
     using Case = std::tuple<int, unsigned, uintptr_t>; /* descriptor, registered mask, reported bit */
     for (auto [fd, events, bit] :
          {Case{wants_write.fd[0], SEL_WRITE, SEL_WRITE}, Case{wants_both.fd[0], 3, SEL_READ},

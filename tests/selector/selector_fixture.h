@@ -1,6 +1,5 @@
-/* The selector's fixture: a context on the test's thread and a scripted host.
- * scripted_host.cpp defines the host functions that the select loop calls;
- * they behave as `host` says and log the calls that shape a pass. */
+/* The selector's fixture: a context on the test's thread and a scripted host, whose functions
+ * (scripted_host.cpp) behave as `host` says and log the calls that shape a pass. */
 #ifndef QORBU_TESTS_SELECTOR_FIXTURE_H
 #define QORBU_TESTS_SELECTOR_FIXTURE_H
 
