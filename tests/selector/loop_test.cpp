@@ -187,6 +187,56 @@ TEST_F(SelectorTest, FailedWaitsAbortAtAClosedDescriptorOrTheFifthEinval) {
                  "invalid params in select 1 tl fd 1 snmp fd 0 fdsetsize 1024 timeval 0:1500000000");
 }
 
+/* Hosts and Net-SNMP may report descriptors past FD_SETSIZE: the wait never
+ * gets wider than the sets (the refused time-out's message shows the width). */
+TEST_F(SelectorTest, WaitWidthNeverExceedsTheSets) {
+    SelSetZG(&host.context);
+    host.snmp_blocks = false, host.snmp_timeout = {0, 1500000};
+    Pipe idle(40), hosts(41);
+    ASSERT_EQ(watch(idle.r), 0);
+    using Case = std::tuple<int, int, int>; /* Net-SNMP's count, the host's max_fd, the width */
+    for (auto [count, max_fd, width] : {Case{2000, -1, 1024}, Case{FD_SETSIZE + 1, -1, 1024},
+                                        Case{0, INT_MAX, 42}, Case{5000, INT_MAX, 1024}}) {
+        host.snmp_count = count, host.scheduler.max_fd = max_fd;
+        FD_ZERO(&host.scheduler.readfd);
+        if (max_fd >= 0) FD_SET(41, &host.scheduler.readfd);
+        qorbu::sel::sel_einval_count.store(0);
+        testing::internal::CaptureStderr();
+        EXPECT_EQ(SelSelect(), -1);
+        EXPECT_NE(testing::internal::GetCapturedStderr().find("select " + std::to_string(width) + " tl"),
+                  std::string::npos)
+            << count << " " << max_fd;
+    }
+}
+
+/* zarn_select refuses a closed descriptor before registering anything, and
+ * takes any time-out: microseconds carry into seconds, the largest saturates. */
+TEST_F(SelectorTest, ZarnSelectRefusesClosedDescriptorsAndTakesAnyTimeout) {
+    Pipe ready;
+    ready.fill();
+    const int closed = dup(ready.w);
+    close(closed);
+    const int timers = ctx->timerCount;
+    fd_set r{};
+    FD_SET(ready.r, &r), FD_SET(closed, &r);
+    timeval none{0, 0};
+    EXPECT_EQ(OUTCOME(zarn_select(std::max(ready.r, closed) + 1, &r, nullptr, nullptr, &none)),
+              failure(EBADF));
+    EXPECT_TRUE(ctx->nfds <= 1 && ctx->timerCount == timers) << "a registration or the timer stayed";
+    for (timeval timeout : {timeval{0, 2500000}, timeval{LONG_MAX, 0}, timeval{LONG_MAX, 999999}}) {
+        FD_ZERO(&r);
+        FD_SET(ready.r, &r);
+        EXPECT_EQ(zarn_select(ready.r + 1, &r, nullptr, nullptr, &timeout), 1) << timeout.tv_sec;
+    }
+    timespec now, when;
+    SelGetTime(&now);
+    for (auto [sec, nsec] :
+         {std::pair{0L, 1999999999L}, std::pair{LONG_MAX, 0L}, std::pair{LONG_MAX, LONG_MAX}}) {
+        ASSERT_EQ(SelMakeWhen(&when, sec, nsec), 0);
+        EXPECT_TRUE(when.tv_nsec >= 0 && when.tv_nsec < 1000000000 && when.tv_sec >= now.tv_sec + 1) << sec;
+    }
+}
+
 TEST_F(SelectorTest, ZarnSelectReportsLikeSelectAndLeavesNoTrace) {
     SocketPair both; /* fd[0] readable and writable */
     Pipe idle;
@@ -222,6 +272,10 @@ TEST_F(SelectorTest, EpollGivesEachReadyDescriptorOneEventBitThenRunsTimers) {
     bound_wait(0);
     EXPECT_EQ(SelEpoll(), 0);
     EXPECT_EQ(logged(), "ok ok ok ok ok timer") << "one callback each, then the expiry run";
+    const int table = ctx->fdTableSize; /* numbers that cannot be open descriptors grow nothing */
+    EXPECT_EQ(OUTCOME(SelAddFD(INT_MAX - 1, SEL_READ, 0, log_fd, nullptr)), failure(EBUSY));
+    EXPECT_TRUE(SelRemFD(INT_MAX - 1) == -1 && SelGetFDArg(INT_MAX - 1) == nullptr &&
+                ctx->fdTableSize == table);
 }
 
 TEST_F(SelectorTest, EpollDropsTheBatchEventsOfARemovedDescriptor) {

@@ -25,7 +25,7 @@ struct timeval timeval_sub(struct timeval a, struct timeval b) {
 int pal_time_tzcurrent(timeval *now, void *) { return host.log.push_back("clock"), *now = host.now, 0; }
 int snmp_select_info(int *count, fd_set *set, struct timeval *timeout, int *block) {
     host.log.push_back("info");
-    for (int fd = 0; fd < host.snmp_count; ++fd)
+    for (int fd = 0; fd < std::min(host.snmp_count, FD_SETSIZE); ++fd)
         if (FD_ISSET(fd, &host.snmp_set)) FD_SET(fd, set);
     *count = std::max(*count, host.snmp_count);
     if (!host.snmp_blocks) *block = 0, *timeout = host.snmp_timeout;

@@ -1,6 +1,8 @@
 /* The timer heap against the reference heap, the registry's bookkeeping and
  * argument checks, and the reaper. */
+#include <atomic>
 #include <random>
+#include <thread>
 #include <tuple>
 
 #include "heap_interpreter.h"
@@ -44,6 +46,9 @@ TEST_F(SelectorTest, BadArgumentsAreRefusedWithTheirErrno) {
     ASSERT_EQ(SelAddSignal(SIGUSR1), 0);
     const std::pair<Outcome, Outcome> cases[] = {
         {OUTCOME(SelAddFD(5, SEL_IN_CALLBACK, 0, log_fd, nullptr)), failure(EINVAL)},
+        {OUTCOME(SelAddFD(5, SEL_READ, 0, nullptr, nullptr)), failure(EINVAL)},
+        {OUTCOME(SelAddFD(FD_SETSIZE, SEL_READ, 0, log_fd, nullptr)), failure(EINVAL)},
+        {OUTCOME(SelRemFD(INT_MAX)), failure(EINVAL)},
         {OUTCOME(SelAddFD(-1, SEL_READ, 0, log_fd, nullptr)), failure(EINVAL)},
         {OUTCOME(SelAddFD(3, SEL_WRITE, 0, log_fd, nullptr)), failure(EBUSY)},
         {OUTCOME(SelRemFD(4)), failure(EINVAL)},
@@ -57,6 +62,7 @@ TEST_F(SelectorTest, BadArgumentsAreRefusedWithTheirErrno) {
         {OUTCOME(SelRemSignal(SIGUSR1)), {0, 0}},
         {OUTCOME(SelRemSignal(SIGUSR1)), failure(EINVAL)}};
     for (size_t i = 0; i < std::size(cases); ++i) EXPECT_EQ(cases[i].first, cases[i].second) << "case " << i;
+    EXPECT_EQ(ctx->fdTableSize, 4) << "refused numbers grew the table";
     EXPECT_FALSE(blocked(SIGUSR1));
 }
 
@@ -80,4 +86,39 @@ TEST_F(SelectorTest, ReaperClosesTrackedReadDescriptorsIdleForMoreThan25Seconds)
     idle26.r = -1;
     for (int fd : {idle25.r, untracked.r, write_only.w}) EXPECT_NE(fcntl(fd, F_GETFD), -1) << fd;
     EXPECT_TRUE(fd_timer.heapIndex != 0 && soon.tv_sec <= fd_timer.when.tv_sec) << "re-armed 30 s ahead";
+}
+
+/* The reaper's owner ends after two other selector threads started: the next
+ * pass of one of them (select or epoll) takes the reaper over, and only one. */
+TEST(SelectorThreads, ReaperPassesToAnotherThreadWhenItsOwnerEnds) {
+    for (int (*pass)() : {SelSelect, SelEpoll}) {
+        if (pass == SelEpoll) {
+            ASSERT_EQ(SelUseEpoll(), 0);
+        }
+        std::atomic<int> stage{0};
+        auto await = [&stage](int s) {
+            while (stage.load() < s) std::this_thread::yield();
+        };
+        std::thread owner([&] {
+            EXPECT_TRUE(SelInit() == 0 && SelDebugIsTimerActive(&fd_timer) == 1);
+            stage = 1, await(3);
+        });
+        int holds[2] = {-1, -1};
+        std::vector<std::thread> others;
+        for (int i = 0; i < 2; ++i)
+            others.emplace_back([&, i] {
+                await(1);
+                EXPECT_TRUE(SelInit() == 0 && SelDebugIsTimerActive(&fd_timer) == 0) << "one owner at a time";
+                stage.fetch_add(1), await(4);
+                SelTimer due{};
+                due.callback = [](SelTimer *) { return 0; }; /* host.log is not for threads */
+                EXPECT_TRUE(SelSleep(&due, 0) == 0 && pass() == 0);
+                holds[i] = SelDebugIsTimerActive(&fd_timer);
+                stage.fetch_add(1), await(6); /* both passes done before either thread ends */
+            });
+        owner.join();
+        stage = 4;
+        for (auto &t : others) t.join();
+        EXPECT_EQ(holds[0] + holds[1], 1) << (pass == SelSelect ? "select" : "epoll");
+    }
 }
