@@ -40,10 +40,8 @@ class BuddyModel {
     /* The block ShmAlloc must return, 0 for ENOMEM. A block keeps its link
      * word clear of the class word of the block above it. */
     uintptr_t alloc(uint32_t n) {
-        int k = 0;
-        while (k < kClasses &&
-               (n + uint64_t{sizeof(uintptr_t)} > class_bytes(k) || class_bytes(k) < 2 * sizeof(uintptr_t)))
-            k++;
+        int k = sizeof(uintptr_t) == 8 ? 1 : 0;
+        while (k < kClasses && n + uint64_t{sizeof(uintptr_t)} > class_bytes(k)) k++;
         int j = k;
         while (j < kClasses && lists[j].empty()) j++;
         if (n >= 0x40000000u || j >= kClasses) return 0;
@@ -83,37 +81,26 @@ inline std::string list_difference(const ShmHeader *h, const BuddyModel &model) 
     return "";
 }
 
-/* ShmFree with standard error caught; returns what it wrote there. */
-inline std::string free_catching_stderr(ShmHandle *h, void *p) {
-    char text[128] = "";
-    FILE *saved = stderr;
-    stderr = fmemopen(text, sizeof text - 1, "w");
-    ShmFree(h, p);
-    fclose(stderr);
-    stderr = saved;
-    return text;
-}
-
+/* Random operations, checked after each one. With `modelled` false, other
+ * processes share the segment: only the patterns and the errors are checked. */
 class OperationRun {
   public:
-    explicit OperationRun(ShmHandle *h) : h_(h), model_(h) {}
+    explicit OperationRun(ShmHandle *h, bool modelled = true) : h_(h), model_(h), modelled_(modelled) {}
 
-    /* One operation chosen by op, with arg as its size or choice; "" or what went wrong. */
+    /* One operation chosen by op, arg its size or choice; "" or what went wrong. */
     std::string step(uint32_t op, uint32_t arg) {
-        std::string broken;
-        switch (op % 8) {
-        case 0:
-        case 1:
-        case 2:
-        case 3: broken = alloc((arg >> 5) & ((1u << arg % 26) - 1)); break;
-        case 4:
-        case 5: broken = live_.empty() ? "" : release(arg % live_.size()); break;
-        case 6: broken = free_interior(arg); break;
-        default:
-            if (ShmTotalFree(h_) != model_.free_bytes()) return "ShmTotalFree differs from the model";
-            broken = alloc(arg); // mostly sizes no class holds
-        }
-        if (!broken.empty()) return broken;
+        const char *broken = nullptr;
+        if (op % 8 < 4 || live_.empty())
+            broken = alloc((arg >> 5) & ((1u << arg % 26) - 1));
+        else if (op % 8 < 6)
+            broken = release(arg % live_.size());
+        else if (op % 8 == 6)
+            broken = free_interior(arg);
+        else if (modelled_ && ShmTotalFree(h_) != model_.free_bytes())
+            broken = "ShmTotalFree is not the model's";
+        else
+            broken = alloc(arg); // mostly sizes that no class holds
+        if (broken != nullptr || !modelled_) return broken != nullptr ? broken : "";
         if (h_->base->busy != 0) return "busy left set";
         if (pthread_mutex_trylock(&h_->base->mutex) != 0) return "the segment mutex was left locked";
         pthread_mutex_unlock(&h_->base->mutex);
@@ -124,68 +111,72 @@ class OperationRun {
      * (segments the library places), the lists must then be a fresh segment's. */
     std::string finish() {
         while (!live_.empty()) {
-            if (std::string broken = release(live_.size() - 1); !broken.empty()) return broken;
+            if (const char *broken = release(live_.size() - 1)) return broken;
         }
+        if (!modelled_) return "";
         const uintptr_t data = reinterpret_cast<uintptr_t>(ShmAddr(h_)), length = h_->size - page_bytes();
-        const uintptr_t span = std::min(std::bit_ceil(length), class_bytes(kClasses - 1));
-        if (data % span == 0) model_ = BuddyModel(h_);
-        if (std::string broken = list_difference(h_->base, model_); !broken.empty()) return broken;
-        return ShmTotalFree(h_) == length ? "" : "not every byte came back";
+        if (data % std::min(std::bit_ceil(length), class_bytes(kClasses - 1)) == 0) model_ = BuddyModel(h_);
+        const std::string broken = list_difference(h_->base, model_);
+        return broken.empty() && ShmTotalFree(h_) != length ? "not every byte came back" : broken;
     }
 
   private:
     struct Live {
-        uintptr_t block;
+        unsigned char *p;
         uint32_t n;
-        unsigned char fill() const { return static_cast<unsigned char>(block >> 3 | 1); }
+        unsigned char fill; // odd: a word of it never names a list
         bool intact() const {
-            const auto *bytes = reinterpret_cast<const unsigned char *>(block);
-            return std::all_of(bytes, bytes + n, [&](unsigned char b) { return b == fill(); });
+            return std::all_of(p, p + n, [&](unsigned char b) { return b == fill; });
         }
     };
 
-    std::string alloc(uint32_t n) {
-        const uintptr_t expected = model_.alloc(n);
+    const char *alloc(uint32_t n) {
+        const uintptr_t expected = modelled_ ? model_.alloc(n) : 0;
         errno = 0;
-        const auto got = reinterpret_cast<uintptr_t>(ShmAlloc(h_, n));
-        if (got != expected)
-            return "ShmAlloc(" + std::to_string(n) + ") returned another block than the model";
-        if (got == 0)
-            return errno == ENOMEM ? "" : "ShmAlloc(" + std::to_string(n) + ") failed without ENOMEM";
-        if (reinterpret_cast<uintptr_t *>(got)[-1] !=
-            reinterpret_cast<uintptr_t>(&h_->base->freeList[model_.live[got]]))
+        auto *p = static_cast<unsigned char *>(ShmAlloc(h_, n));
+        if (p == nullptr)
+            return expected == 0 && errno == ENOMEM ? nullptr : "ShmAlloc failed unlike the model";
+        if (!modelled_) {
+        } else if (reinterpret_cast<uintptr_t>(p) != expected) {
+            return "ShmAlloc returned another block than the model";
+        } else if (reinterpret_cast<uintptr_t *>(p)[-1] !=
+                   uintptr_t(&h_->base->freeList[model_.live[expected]])) {
             return "the class word does not name the block's list";
-        live_.push_back({got, n});
-        memset(reinterpret_cast<void *>(got), live_.back().fill(), n);
-        return "";
+        }
+        live_.push_back({p, n, static_cast<unsigned char>(getpid() * 8 + live_.size() * 2 + 1)});
+        memset(p, live_.back().fill, n);
+        return nullptr;
     }
 
-    std::string release(size_t i) {
+    const char *release(size_t i) {
         const Live l = live_[i];
         live_[i] = live_.back();
         live_.pop_back();
         if (!l.intact()) return "a live block lost its pattern";
-        model_.free(l.block);
+        if (modelled_) model_.free(uintptr_t(l.p));
         errno = 0;
-        ShmFree(h_, reinterpret_cast<void *>(l.block));
-        return errno == 0 ? "" : "ShmFree set errno " + std::to_string(errno);
+        ShmFree(h_, l.p);
+        return errno == 0 ? nullptr : "ShmFree set errno";
     }
 
-    /* A pointer inside a live block, its word below the caller's (odd)
-     * pattern: no block, so ShmFree must refuse it and change nothing. */
-    std::string free_interior(uint32_t arg) {
-        if (live_.empty()) return "";
+    /* A pointer inside a live block: ShmFree must refuse it, changing nothing. */
+    const char *free_interior(uint32_t arg) {
         const Live &l = live_[arg % live_.size()];
-        if (l.n < 2 * sizeof(uintptr_t)) return "";
-        const uintptr_t p = l.block + sizeof(uintptr_t) * (1 + arg / 32 % (l.n / sizeof(uintptr_t) - 1));
-        if (free_catching_stderr(h_, reinterpret_cast<void *>(p)) !=
-            "ShmFree(): mismatched handle and pointer\n")
-            return "a pointer inside a block was not refused";
-        return "";
+        const uint32_t words = l.n / sizeof(uintptr_t);
+        if (words < 2) return nullptr;
+        char text[64] = "";
+        FILE *saved = stderr;
+        stderr = fmemopen(text, sizeof text - 1, "w");
+        ShmFree(h_, l.p + sizeof(uintptr_t) * (1 + arg / 32 % (words - 1)));
+        fclose(stderr);
+        stderr = saved;
+        return strcmp(text, "ShmFree(): mismatched handle and pointer\n") == 0 ? nullptr
+                                                                               : "an inner pointer was freed";
     }
 
     ShmHandle *h_;
     BuddyModel model_;
+    bool modelled_;
     std::vector<Live> live_;
 };
 
