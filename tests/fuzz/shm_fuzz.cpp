@@ -1,30 +1,24 @@
 /* libFuzzer target for the buddy allocator: the first byte sizes a segment
- * that the library places, every five further bytes are an operation of
- * the run in tests/shm/shm_ops.h. */
+ * that the library places, the rest are the random numbers of the operation
+ * run in tests/shm/shm_ops.h. */
 #include "shm/shm_ops.h"
 
-#include <cstdio>
 #include <cstdlib>
-#include <cstring>
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
-    using namespace qorbu::test;
     if (size == 0) return 0;
-    static int counter = 0;
-    const std::string name = "qorbu-fuzz-" + std::to_string(getpid()) + "-" + std::to_string(counter++);
-    ShmHandle *h =
-        ShmCreate(name.c_str(), nullptr, uint32_t(1 + data[0] % 64) * uint32_t(page_bytes()) - data[0]);
+    const std::string name = "qorbu-fuzz-" + std::to_string(getpid());
+    const uint32_t bytes = uint32_t(1 + data[0] % 64) * uint32_t(qorbu::test::page_bytes()) - data[0];
+    ShmHandle *h = ShmCreate(name.c_str(), nullptr, bytes);
     ShmUnlink(name.c_str());
-    if (h == nullptr) abort();
-    OperationRun run(h);
-    std::string broken;
-    for (size_t i = 1; i + 5 <= size && broken.empty(); i += 5) {
-        uint32_t arg;
-        memcpy(&arg, data + i + 1, sizeof arg);
-        broken = run.step(data[i], arg);
-    }
-    if (broken.empty()) broken = run.finish();
-    ShmClose(h);
+    auto next = [at = data + 1, end = data + size]() mutable {
+        uint32_t v = 0;
+        for (int i = 0; i < 4 && at < end; i++) v = v << 8 | *at++;
+        return v;
+    };
+    const std::string broken =
+        h != nullptr ? qorbu::test::OperationRun(h).run(next, int(size / 8)) : "ShmCreate";
     if (!broken.empty()) fprintf(stderr, "shm fuzz: %s\n", broken.c_str()), abort();
+    ShmClose(h);
     return 0;
 }
