@@ -1,6 +1,5 @@
-/* libFuzzer target for the buddy allocator: the first byte sizes a segment
- * that the library places, the rest are the random numbers of the operation
- * run in tests/shm/shm_ops.h. */
+/* libFuzzer target for the buddy allocator: byte 0 sizes a segment that the
+ * library places, the rest feed the operation run of tests/shm/shm_ops.h. */
 #include "shm/shm_ops.h"
 
 #include <cstdlib>

@@ -53,11 +53,6 @@ class BuddyModel {
             block = std::min(block, partner(block, k));
         lists[k].insert(block);
     }
-    uint32_t free_bytes() const {
-        uint32_t total = 0;
-        for (int k = 0; k < kClasses; k++) total += static_cast<uint32_t>(lists[k].size() * class_bytes(k));
-        return total;
-    }
     std::set<uintptr_t, std::greater<>> lists[kClasses];
     std::map<uintptr_t, int> live; // block -> class
 };
@@ -81,29 +76,13 @@ class OperationRun {
   public:
     explicit OperationRun(ShmHandle *h, bool modelled = true) : h_(h), model_(h), modelled_(modelled) {}
 
-    /* One operation chosen by op, arg its size or choice; "" or what went wrong. */
-    std::string step(uint32_t op, uint32_t arg) {
-        const uint32_t kind = live_.empty() ? 0 : op % 8;
-        const char *broken = kind < 4   ? alloc((arg >> 5) & ((1u << arg % 26) - 1))
-                             : kind < 6 ? release(arg % live_.size())
-                             : kind < 7 ? free_inside(live_[arg % live_.size()], arg / 32)
-                             : modelled_ && ShmTotalFree(h_) != model_.free_bytes()
-                                 ? "ShmTotalFree is not the model's"
-                                 : alloc(arg);
-        if (broken != nullptr || !modelled_) return broken != nullptr ? broken : "";
-        if (h_->base->busy != 0) return "busy left set";
-        if (pthread_mutex_trylock(&h_->base->mutex) != 0) return "the segment mutex was left locked";
-        pthread_mutex_unlock(&h_->base->mutex);
-        return list_difference(h_->base, model_);
-    }
-
-    /* `count` operations with random numbers from rng, then every live block
-     * freed. Where the data area is aligned to its size (segments that the
-     * library places) the lists must then be a fresh segment's. */
+    /* `count` operations chosen by random numbers from rng, each checked,
+     * then every live block freed. Where the data area is aligned to its size
+     * (segments that the library places) the lists are then a fresh segment's. */
     template <typename Rng>
     std::string run(Rng &rng, int count, uint32_t arg_mask = ~0u) {
         std::string broken;
-        for (int op = 0; op < count && broken.empty(); op++) broken = step(rng(), rng() & arg_mask);
+        for (int op = 0; op < count && broken.empty(); op++) broken = step(rng() % 8, rng() & arg_mask);
         while (broken.empty() && !live_.empty()) broken = release(live_.size() - 1) ?: "";
         if (!broken.empty() || !modelled_) return broken;
         const uintptr_t data = reinterpret_cast<uintptr_t>(ShmAddr(h_)), length = h_->size - page_bytes();
@@ -113,6 +92,18 @@ class OperationRun {
     }
 
   private:
+    std::string step(uint32_t kind, uint32_t arg) {
+        const char *broken = kind < 4 || live_.empty() ? alloc((arg >> 5) & ((1u << arg % 26) - 1))
+                             : kind < 6                ? release(arg % live_.size())
+                             : kind < 7                ? free_inside(live_[arg % live_.size()], arg / 32)
+                                                       : alloc(arg); // mostly sizes that no class holds
+        if (broken != nullptr || !modelled_) return broken != nullptr ? broken : "";
+        if (h_->base->busy != 0) return "busy left set";
+        if (pthread_mutex_trylock(&h_->base->mutex) != 0) return "the segment mutex was left locked";
+        pthread_mutex_unlock(&h_->base->mutex);
+        return list_difference(h_->base, model_);
+    }
+
     struct Live {
         unsigned char *p;
         uint32_t n;
