@@ -210,9 +210,9 @@ TEST_F(Shm, LockShutsOutOtherProcessesAndWakesThem) {
     };
     std::optional<qorbu::shm::SegmentLock> lock(std::in_place, h);
     EXPECT_EQ(blocked_until([&] { lock.reset(); }), (std::pair{true, 0})) << "mutex: (waited, status)";
+    ASSERT_NE(keep(ShmOpen(name(), O_RDWR)), nullptr);
     const int other = shm_open(("/" + std::string(name())).c_str(), O_RDONLY, 0);
     ASSERT_EQ(flock(other, LOCK_EX), 0);
-    ASSERT_NE(keep(ShmOpen(name(), O_RDWR)), nullptr);
     EXPECT_EQ(blocked_until([&] { flock(other, LOCK_UN); }), (std::pair{true, 0}))
         << "flock: (waited, status)";
     ::close(other);
