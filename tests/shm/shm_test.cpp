@@ -245,7 +245,7 @@ TEST_F(Shm, ProcessesShareASegmentAndSurviveOneKilledHoldingTheLock) {
                 if (busy) lock.mark_busy();
                 return lock.error() == 0 ? usleep(200 * 1000), raise(SIGKILL) : 1;
             },
-            60);
+            30);
     };
     const pid_t holder = kEmulated ? 0 : killed_holding_lock(false); // qemu-user: no robust mutexes
     std::vector<pid_t> workers;
@@ -257,10 +257,10 @@ TEST_F(Shm, ProcessesShareASegmentAndSurviveOneKilledHoldingTheLock) {
                     OperationRun(ShmOpen(name(), O_RDWR), false).run(rng, scaled(20000, 2000), 0x7ffff);
                 return broken.empty() ? 0 : (fputs(broken.c_str(), stderr), 1);
             },
-            200));
+            30));
     }
     EXPECT_TRUE(holder == 0 || wait_status(holder) == 128 + SIGKILL);
-    for (pid_t pid : workers) EXPECT_EQ(wait_status(pid), 0);
+    for (pid_t pid : workers) EXPECT_EQ(wait_status(pid), 0) << "142: waited for the lock for ever";
     EXPECT_EQ(list_difference(h->base, BuddyModel(h)), "") << "all freed: the lists of a fresh segment";
     if (kEmulated) GTEST_SKIP() << "qemu-user lacks robust mutexes: no holder killed";
 
