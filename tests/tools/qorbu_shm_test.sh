@@ -1,17 +1,16 @@
 #!/bin/bash
 # qorbu-shm as scripts drive it: exit codes and one-line errors, one case per
-# behaviour; segments damaged through /dev/shm. Usage: $0 CASE QORBU_SHM WORD_BYTES
+# behaviour; segments damaged through /dev/shm. Usage: $0 CASE WORD_BYTES [EMULATOR...] QORBU_SHM
 set -u
-CASE=$1 BIN=$2 W=$3
-EMULATOR=(${QORBU_TEST_EMULATOR:-}) # cross builds run the tool under qemu-user
+CASE=$1 W=$2 TOOL=("${@:3}")
 NAME=qorbu-shm-test-$CASE-$$ FAILURES=0 OUT=$(mktemp) ERR=$(mktemp)
 SEG=/dev/shm/$NAME BUSY=$((W == 8 ? 60 : 36)) LISTS=$((W == 8 ? 64 : 40))
-trap '"${EMULATOR[@]}" "$BIN" unlink "$NAME" >/dev/null 2>&1; rm -f "$OUT" "$ERR"' EXIT
+trap '"${TOOL[@]}" unlink "$NAME" >/dev/null 2>&1; rm -f "$OUT" "$ERR"' EXIT
 fail() { echo "FAIL: $*"; sed 's/^/  | /' "$OUT" "$ERR"; FAILURES=$((FAILURES + 1)); }
 # run STATUS ERROR_PATTERN ARGS...: the exit status, and stderr one matching line (or empty pattern)
 run() {
     local expected=$1 pattern=$2; shift 2
-    "${EMULATOR[@]}" "$BIN" "$@" >"$OUT" 2>"$ERR"; local status=$?
+    timeout 60 "${TOOL[@]}" "$@" >"$OUT" 2>"$ERR"; local status=$? # 124: it hung
     [ "$status" = "$expected" ] || fail "qorbu-shm $* exited $status, expected $expected"
     [ -z "$pattern" ] || { [ "$(wc -l <"$ERR")" = 1 ] && grep -Eq -- "^qorbu-shm: .*$pattern" "$ERR"; } ||
         fail "qorbu-shm $*: expected one error line matching /$pattern/"
@@ -22,7 +21,6 @@ poke() { perl -e 'open F, "+<", $ARGV[0] or die; seek F, $ARGV[1], 0; print F pa
 
 case_bad_arguments() {
     run 2 "unknown command 'frob'" frob x
-    run 2 'usage: qorbu-shm create NAME SIZE' create "$NAME"
     for bad in "" a/b a:b; do run 2 "invalid segment name '$bad'" create "$bad" 4096; done
     for bad in 0 12x -5 5000000k 4096m; do run 2 "invalid size '$bad'" create "$NAME" "$bad"; done
     run 2 "invalid address '0x1001'" create "$NAME" 4096 0x1001
