@@ -16,7 +16,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t *data, size_t size) {
         return v;
     };
     const std::string broken =
-        h != nullptr ? qorbu::test::OperationRun(h).run(next, int(size / 8)) : "ShmCreate";
+        h != nullptr ? qorbu::test::OperationRun(h, true).run(next, int(size / 8)) : "ShmCreate";
     if (!broken.empty()) fprintf(stderr, "shm fuzz: %s\n", broken.c_str()), abort();
     ShmClose(h);
     return 0;

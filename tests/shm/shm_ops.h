@@ -70,23 +70,23 @@ inline std::string list_difference(const ShmHeader *h, const BuddyModel &model) 
     return "";
 }
 
-/* Random operations, checked after each one. With `modelled` false, other
- * processes share the segment: only the patterns and the errors are checked. */
+/* Random operations, each checked. With `modelled` false other processes share
+ * the segment: only patterns and errors are checked. A segment that the library
+ * `placed` has its data area aligned to its size: freed, it is as fresh. */
 class OperationRun {
   public:
-    explicit OperationRun(ShmHandle *h, bool modelled = true) : h_(h), model_(h), modelled_(modelled) {}
+    OperationRun(ShmHandle *h, bool placed, bool modelled = true)
+        : h_(h), model_(h), placed_(placed), modelled_(modelled) {}
 
-    /* `count` operations chosen by random numbers from rng, each checked,
-     * then every live block freed. Where the data area is aligned to its size
-     * (segments that the library places) the lists are then a fresh segment's. */
+    /* `count` operations chosen by random numbers from rng, then every live block freed. */
     template <typename Rng>
     std::string run(Rng &rng, int count, uint32_t arg_mask = ~0u) {
         std::string broken;
         for (int op = 0; op < count && broken.empty(); op++) broken = step(rng() % 8, rng() & arg_mask);
         while (broken.empty() && !live_.empty()) broken = release(live_.size() - 1) ?: "";
         if (!broken.empty() || !modelled_) return broken;
-        const uintptr_t data = reinterpret_cast<uintptr_t>(ShmAddr(h_)), length = h_->size - page_bytes();
-        if (data % std::min(std::bit_ceil(length), class_bytes(kClasses - 1)) == 0) model_ = BuddyModel(h_);
+        const uint32_t length = h_->size - static_cast<uint32_t>(page_bytes());
+        if (placed_) model_ = BuddyModel(h_);
         broken = list_difference(h_->base, model_);
         return broken.empty() && ShmTotalFree(h_) != length ? "not every byte came back" : broken;
     }
@@ -147,7 +147,7 @@ class OperationRun {
 
     ShmHandle *h_;
     BuddyModel model_;
-    bool modelled_;
+    bool placed_, modelled_;
     std::vector<Live> live_;
 };
 

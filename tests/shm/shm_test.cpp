@@ -228,7 +228,7 @@ TEST_F(Shm, RandomOperationsFollowTheModel) {
         for (bool placed : {true, false}) { // else the data area lies a page above a 64 KiB boundary
             ShmHandle *h = create(bytes, placed ? 0 : free_data_address(bytes + 2 * kPage, 1 << 16), shape++);
             ASSERT_NE(h, nullptr);
-            EXPECT_EQ(OperationRun(h).run(rng, scaled(3000, 600)), "")
+            EXPECT_EQ(OperationRun(h, placed).run(rng, scaled(3000, 600)), "")
                 << bytes << " bytes, placed " << placed;
             close(h);
         }
@@ -257,7 +257,7 @@ TEST_F(Shm, ProcessesShareASegmentAndSurviveOneKilledHoldingTheLock) {
             [&, i] {
                 std::mt19937 rng(i);
                 const std::string broken =
-                    OperationRun(ShmOpen(name(), O_RDWR), false).run(rng, scaled(20000, 2000), 0x7ffff);
+                    OperationRun(ShmOpen(name(), O_RDWR), true, false).run(rng, scaled(20000, 2000), 0x7ffff);
                 return broken.empty() ? 0 : (fputs(broken.c_str(), stderr), 1);
             },
             30));
