@@ -228,7 +228,7 @@ TEST_F(Shm, RandomOperationsFollowTheModel) {
         for (bool placed : {true, false}) { // else the data area lies a page above a 64 KiB boundary
             ShmHandle *h = create(bytes, placed ? 0 : free_data_address(bytes + 2 * kPage, 1 << 16), shape++);
             ASSERT_NE(h, nullptr);
-            EXPECT_EQ(OperationRun(h, placed).run(rng, scaled(3000, 600)), "")
+            ASSERT_EQ(OperationRun(h, placed).run(rng, scaled(3000, 600)), "")
                 << bytes << " bytes, placed " << placed;
             close(h);
         }

@@ -10,7 +10,7 @@ fail() { echo "FAIL: $*"; sed 's/^/  | /' "$OUT" "$ERR"; FAILURES=$((FAILURES + 
 # run STATUS ERROR_PATTERN ARGS...: the exit status, and stderr one matching line (or empty pattern)
 run() {
     local expected=$1 pattern=$2; shift 2
-    timeout 60 "${TOOL[@]}" "$@" >"$OUT" 2>"$ERR"; local status=$? # 124: it hung
+    timeout 20 "${TOOL[@]}" "$@" >"$OUT" 2>"$ERR"; local status=$? # 124: it hung
     [ "$status" = "$expected" ] || fail "qorbu-shm $* exited $status, expected $expected"
     [ -z "$pattern" ] || { [ "$(wc -l <"$ERR")" = 1 ] && grep -Eq -- "^qorbu-shm: .*$pattern" "$ERR"; } ||
         fail "qorbu-shm $*: expected one error line matching /$pattern/"
