@@ -10,13 +10,12 @@
 namespace qorbu::test {
 using namespace qorbu::gt;
 
-/* Runs fn() in a new green thread. */
 template <typename Fn>
 Greenthread *spawn(Fn *fn) {
     return greenthread_create([](void *arg) { (*static_cast<Fn *>(arg))(); }, fn);
 }
 
-/* greenthreads_run, stopped by a ticking timer once `seconds` have passed:
+/* greenthreads_run, ended by a ticking timer once `seconds` have passed:
  * false when some thread had not finished by then. */
 inline bool run_for(double seconds) {
     static double deadline;
@@ -37,19 +36,14 @@ inline unsigned registered(int fd) {
     const SelContext *ctx = SelCurrentContext();
     return fd < 0 || fd >= ctx->fdTableSize ? 0 : ctx->fdTable[fd].events;
 }
+inline int armed_timers() { return SelCurrentContext()->timerCount; }
+
 class GreenThreads : public ::testing::Test {
-  protected:
     void SetUp() override {
         ASSERT_EQ(SelInit(), 0);
+        SelRemoveAllTimers(); // the idle reaper's
         greenthreads_init();
-        timers_before = SelCurrentContext()->timerCount;
     }
-    /* Every wait removes its registration and its timer. */
-    void expect_released(int fd) {
-        EXPECT_EQ(registered(fd), 0u) << "descriptor " << fd;
-        EXPECT_EQ(SelCurrentContext()->timerCount, timers_before);
-    }
-    int timers_before = 0;
 };
 
 } // namespace qorbu::test

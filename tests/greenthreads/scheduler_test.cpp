@@ -31,15 +31,14 @@ TEST_F(GreenThreads, RunQueueIsFifoAndTheMainContextTakesOneTurnPerPass) {
     greenthread_create(log_twice, letter('B'));
     EXPECT_EQ(trace, "") << "a new thread waits for its creator to yield";
     EXPECT_EQ(queued(), 2);
-    const struct {
-        const char *trace;
-        int queued, live;
-    } passes[] = {{"AB", 2, 2}, {"ABAB", 2, 2}, {"ABAB", 0, 0}, {"ABAB", 0, 0}};
-    for (const auto &pass : passes) { // the last: yielding alone returns at once
+    // Trace, queue length and live threads after each pass; in the last, yielding alone returns at once.
+    const std::tuple<const char *, int, int> passes[] = {
+        {"AB", 2, 2}, {"ABAB", 2, 2}, {"ABAB", 0, 0}, {"ABAB", 0, 0}};
+    for (const auto &[expected, length, live] : passes) {
         greenthread_yield();
-        EXPECT_EQ(trace, pass.trace);
-        EXPECT_EQ(queued(), pass.queued);
-        EXPECT_EQ(live_threads, pass.live);
+        EXPECT_EQ(trace, expected);
+        EXPECT_EQ(queued(), length);
+        EXPECT_EQ(live_threads, live);
     }
 }
 
@@ -88,8 +87,7 @@ TEST_F(GreenThreads, FinishedRecordsAreReusedNewestFirstWithTheirStacks) {
     ASSERT_EQ(greenthread_create(note, letter(4)), second);
     ASSERT_EQ(greenthread_create(note, letter(5)), first);
     Greenthread *fresh = greenthread_create(note, letter(6));
-    EXPECT_NE(fresh, first);
-    EXPECT_NE(fresh, second);
+    EXPECT_TRUE(fresh != first && fresh != second);
     EXPECT_EQ(queued(), 3);
     greenthread_yield();
     EXPECT_EQ(arg, 6);
@@ -124,21 +122,6 @@ TEST_F(GreenThreads, RunLoopWaitsInTheSelectorOnlyWhenEveryThreadIsBlocked) {
     EXPECT_EQ(trace, "YYT");
 }
 
-TEST_F(GreenThreads, StacksAreGuardedWritableAndNotExecutable) {
-    static uintptr_t local;
-    Greenthread *thread = greenthread_create(
-        [](void *) { local = reinterpret_cast<uintptr_t>(__builtin_frame_address(0)); }, nullptr);
-    ASSERT_TRUE(run_for(10));
-    const auto base = reinterpret_cast<uintptr_t>(thread->context.uc_stack.ss_sp);
-    const size_t size = thread->context.uc_stack.ss_size, page = static_cast<size_t>(page_size);
-    EXPECT_EQ(size - page, std::max<size_t>(16384, page)) << "16 KiB in whole pages above the guard page";
-    EXPECT_TRUE(local > base + page && local < base + size);
-    EXPECT_TRUE(mapping_at(base).inaccessible());
-    EXPECT_EQ(mapping_at(base + page).perms, "rw-p");
-    EXPECT_TRUE(mapping_at(base + page).starts_here);
-    EXPECT_EQ(mapping_at(base + size - 1).perms, "rw-p");
-}
-
 uintptr_t guard;
 __attribute__((noinline)) int recurse(int depth) {
     volatile char frame[256];
@@ -146,26 +129,31 @@ __attribute__((noinline)) int recurse(int depth) {
     return depth < 1 << 30 ? recurse(depth + 1) + frame[0] : 0;
 }
 
-[[noreturn]] void overflow_in_child() {
+[[noreturn]] void overflow(uintptr_t guard_page) {
     static char alt_stack[64 * 1024];
     const stack_t alt = {alt_stack, 0, sizeof alt_stack};
-    sigaltstack(&alt, nullptr);
     struct sigaction on_segv = {};
     on_segv.sa_flags = SA_SIGINFO | SA_ONSTACK;
     on_segv.sa_sigaction = [](int, siginfo_t *info, void *) {
-        const auto fault = reinterpret_cast<uintptr_t>(info->si_addr);
-        _exit(fault >= guard && fault < guard + static_cast<uintptr_t>(page_size) ? 42 : 3);
+        const uintptr_t above_guard = reinterpret_cast<uintptr_t>(info->si_addr) - guard;
+        _exit(above_guard < static_cast<uintptr_t>(page_size) ? 42 : 3);
     };
-    sigaction(SIGSEGV, &on_segv, nullptr);
-    Greenthread *thread = greenthread_create([](void *) { recurse(0); }, nullptr);
-    greenthread_create([](void *) {}, nullptr); // a neighbouring stack
-    guard = reinterpret_cast<uintptr_t>(thread->context.uc_stack.ss_sp);
-    greenthreads_run();
+    guard = guard_page;
+    sigaltstack(&alt, nullptr), sigaction(SIGSEGV, &on_segv, nullptr), greenthreads_run();
     _exit(0);
 }
 
-TEST_F(GreenThreads, OverflowFaultsOnTheThreadsOwnGuardPage) {
-    EXPECT_EXIT(overflow_in_child(), ::testing::ExitedWithCode(42), "");
+TEST_F(GreenThreads, StacksAreGuardedAndNotExecutableAndOverflowFaultsOnTheThreadsOwnGuardPage) {
+    const Greenthread *thread = greenthread_create([](void *) { recurse(0); }, nullptr);
+    greenthread_create([](void *) {}, nullptr); // a neighbouring stack below
+    const auto base = reinterpret_cast<uintptr_t>(thread->context.uc_stack.ss_sp);
+    const size_t size = thread->context.uc_stack.ss_size, page = static_cast<size_t>(page_size);
+    EXPECT_EQ(size - page, std::max<size_t>(16384, page)) << "16 KiB in whole pages above the guard page";
+    EXPECT_TRUE(mapping_at(base).inaccessible());
+    EXPECT_EQ(mapping_at(base + page).perms, "rw-p");
+    EXPECT_TRUE(mapping_at(base + page).starts_here);
+    EXPECT_EQ(mapping_at(base + size - 1).perms, "rw-p");
+    EXPECT_EXIT(overflow(base), ::testing::ExitedWithCode(42), "");
 }
 
 } // namespace
