@@ -200,7 +200,7 @@ void run_echo_load(int connections, int messages) {
     ASSERT_NE(spawn(&acceptor), nullptr);
     for (intptr_t i = 0; i < connections; ++i)
         ASSERT_NE(greenthread_create(run_client, reinterpret_cast<void *>(i)), nullptr);
-    ASSERT_TRUE(run_for(150));
+    ASSERT_TRUE(run_for(scaled(60, 220))); // native runs take a few seconds
     EXPECT_EQ(state.accepted, connections);
     EXPECT_EQ(state.closed, connections);
     EXPECT_EQ(state.errors, 0);
