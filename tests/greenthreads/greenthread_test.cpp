@@ -46,6 +46,8 @@ inline unsigned registered(int fd) {
 
 class GreenThreads : public ::testing::Test {
     void SetUp() override {
+        const rlimit cpu = {30, RLIM_INFINITY}; // SIGXCPU ends threads that never give the processor back
+        setrlimit(RLIMIT_CPU, &cpu);
         ASSERT_EQ(SelInit(), 0);
         SelRemoveAllTimers(); // the idle reaper's
         greenthreads_init();
@@ -201,13 +203,9 @@ TEST_F(GreenThreads, PollWatchesInAndOutTimesOutAndRefusesWaitsThatCouldNeverEnd
         SCOPED_TRACE(&c - cases);
         SocketPair pair; // fd[0]: writable, readable once the peer writes
         Outcome got;
-        double took = 0, timer_due_in = -1;
+        double timer_due_in = -1;
         unsigned watched = 0;
-        auto waiter = [&] {
-            const double start = seconds_now();
-            got = OUTCOME(nb_poll(pair.fd[0], c.events, c.timeout));
-            took = seconds_now() - start;
-        };
+        auto waiter = [&] { got = OUTCOME(nb_poll(pair.fd[0], c.events, c.timeout)); };
         auto inspector = [&] { // runs once the waiter waits
             watched = registered(pair.fd[0]);
             const SelContext *ctx = SelCurrentContext();
@@ -223,7 +221,6 @@ TEST_F(GreenThreads, PollWatchesInAndOutTimesOutAndRefusesWaitsThatCouldNeverEnd
         EXPECT_EQ(watched, c.watched);
         const double due = c.timeout > 0 && c.error == 0 ? c.timeout / 1e3 : -1; // -1: no timer
         EXPECT_NEAR(timer_due_in, due, 0.25);
-        EXPECT_GE(took, got.first == -1 ? due : 0) << "timed out early";
         EXPECT_EQ(registered(pair.fd[0]), 0u);
         EXPECT_EQ(SelCurrentContext()->timerCount, 0);
     }
