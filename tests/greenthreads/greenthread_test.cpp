@@ -46,7 +46,8 @@ inline unsigned registered(int fd) {
 
 class GreenThreads : public ::testing::Test {
     void SetUp() override {
-        const rlimit cpu = {30, RLIM_INFINITY}; // SIGXCPU ends threads that never give the processor back
+        // SIGXCPU ends threads that never give the processor back.
+        const rlimit cpu = {rlim_t(scaled(30, 300)), RLIM_INFINITY};
         setrlimit(RLIMIT_CPU, &cpu);
         ASSERT_EQ(SelInit(), 0);
         SelRemoveAllTimers(); // the idle reaper's
