@@ -169,7 +169,7 @@ __attribute__((noinline)) int recurse(int depth) {
         _exit(above_guard < static_cast<uintptr_t>(page_size) ? 42 : 3);
     };
     guard = guard_page;
-    sigaltstack(&alt, nullptr), sigaction(SIGSEGV, &on_segv, nullptr), greenthreads_run();
+    sigaltstack(&alt, nullptr), sigaction(SIGSEGV, &on_segv, nullptr), run_for(10);
     _exit(0);
 }
 
