@@ -213,7 +213,9 @@ TEST_F(GreenThreads, PollWatchesInAndOutTimesOutAndRefusesWaitsThatCouldNeverEnd
             for (int i = 1; i <= ctx->timerCount; ++i)
                 if (const SelTimer *t = ctx->timerHeap[i]; t->callback == nb_poll_on_timeout)
                     timer_due_in = t->when.tv_sec + t->when.tv_nsec / 1e9 - seconds_now();
-            if (c.peer_writes) nb_poll(-1, 0, 30), (void)!write(pair.fd[1], "x", 1);
+            if (!c.peer_writes) return; // else first a wakeup from elsewhere: the waiter waits on
+            greenthread_wakeup(static_cast<NbWait *>(SelGetFDArg(pair.fd[0]))->thread);
+            nb_poll(-1, 0, 30), (void)!write(pair.fd[1], "x", 1);
         };
         spawn(&waiter), spawn(&inspector);
         ASSERT_TRUE(run_for(10));
