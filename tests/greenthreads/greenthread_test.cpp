@@ -207,7 +207,7 @@ TEST_F(GreenThreads, PollWatchesInAndOutTimesOutAndRefusesWaitsThatCouldNeverEnd
         double timer_due_in = -1;
         unsigned watched = 0;
         auto waiter = [&] { got = OUTCOME(nb_poll(pair.fd[0], c.events, c.timeout)); };
-        auto inspector = [&] { // runs once the waiter waits
+        auto observer = [&] { // runs once the waiter waits
             watched = registered(pair.fd[0]);
             const SelContext *ctx = SelCurrentContext();
             for (int i = 1; i <= ctx->timerCount; ++i)
@@ -217,7 +217,7 @@ TEST_F(GreenThreads, PollWatchesInAndOutTimesOutAndRefusesWaitsThatCouldNeverEnd
             greenthread_wakeup(static_cast<NbWait *>(SelGetFDArg(pair.fd[0]))->thread);
             nb_poll(-1, 0, 30), (void)!write(pair.fd[1], "x", 1);
         };
-        spawn(&waiter), spawn(&inspector);
+        spawn(&waiter), spawn(&observer);
         ASSERT_TRUE(run_for(10));
         EXPECT_EQ(got.first, c.result);
         EXPECT_EQ(c.error ? got.second : 0, c.error);
