@@ -5,6 +5,7 @@
 #include <sys/time.h>
 #include <csignal>
 #include <functional>
+#include <thread>
 #include <vector>
 
 #include "greenthreads/greenthread_private.h"
@@ -150,6 +151,21 @@ TEST_F(GreenThreads, RunLoopWaitsInTheSelectorOnlyWhenEveryThreadIsBlocked) {
     greenthread_create(log_twice, letter('Y'));
     EXPECT_TRUE(run_for(10));
     EXPECT_EQ(trace, "YYT");
+    // In epoll mode too, with no timer armed: the wait sleeps in the kernel, it does not spin.
+    ASSERT_EQ(SelUseEpoll(), 0);
+    Pipe late;
+    set_nonblocking(late.r);
+    auto reader = [&] {
+        char byte;
+        trace += nb_read(late.r, &byte, 1) == 1 ? 'R' : '!';
+    };
+    spawn(&reader);
+    const uint32_t passes_before = SelCurrentContext()->pass_count;
+    std::thread writer([&] { usleep(200'000), late.fill(); });
+    greenthreads_run();
+    writer.join();
+    EXPECT_EQ(trace, "YYTR");
+    EXPECT_LT(SelCurrentContext()->pass_count - passes_before, 50u) << "the run loop spun";
 }
 
 uintptr_t guard;

@@ -1,6 +1,5 @@
-/* What every test binary shares: the build it runs in, descriptors (pipes,
- * socket pairs, a loopback listener, the descriptor limit), the process's
- * mappings, child processes, and checks of errno. */
+/* What the test binaries share: the build they run in, descriptors, the
+ * process's mappings, child processes, and checks of errno. */
 #ifndef QORBU_TESTS_SUPPORT_TEST_SUPPORT_H
 #define QORBU_TESTS_SUPPORT_TEST_SUPPORT_H
 
@@ -24,9 +23,8 @@
 
 namespace qorbu::test {
 
-/* True under qemu-user (the i386 and armhf builds): qemu lacks robust
- * mutexes, ignores MAP_FIXED_NOREPLACE and runs much slower, so tests scale
- * their counts down (never their checks) or skip with a message. */
+/* Under qemu-user (i386, armhf): slower, no robust mutexes, no
+ * MAP_FIXED_NOREPLACE; tests scale counts down (never checks) or skip. */
 constexpr bool kEmulated =
 #ifdef QORBU_TESTS_EMULATED
     true;
@@ -107,12 +105,10 @@ inline int open_descriptor_count() {
     return count;
 }
 
-/* Permissions ("rw-p", "---p", ...) of the mapping that holds addr, and
- * whether addr is where it starts; empty perms when nothing is mapped there.
- * qemu-user shows the guest's view and leaves inaccessible pages out. */
+/* Permissions ("rw-p", "---p", ...) of the mapping that holds addr; empty
+ * when nothing is mapped there. qemu-user leaves inaccessible pages out. */
 struct Mapping {
     std::string perms;
-    bool starts_here = false;
     bool inaccessible() const { return perms == "---p" || (kEmulated && perms.empty()); }
 };
 inline Mapping mapping_at(uintptr_t addr) {
@@ -122,7 +118,7 @@ inline Mapping mapping_at(uintptr_t addr) {
     unsigned long long low, high;
     while (maps != nullptr && fgets(line, sizeof line, maps) != nullptr) {
         if (sscanf(line, "%llx-%llx %7s", &low, &high, perms) == 3 && addr >= low && addr < high) {
-            found = {perms, addr == low};
+            found = {perms};
             break;
         }
     }
@@ -139,9 +135,8 @@ inline double seconds_now() {
 /* Exit status of pid, or 128 + the signal that ended it. */
 inline int wait_status(pid_t pid) {
     int status = 0;
-    while (waitpid(pid, &status, 0) < 0) {
+    while (waitpid(pid, &status, 0) < 0)
         if (errno != EINTR) return -1;
-    }
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
