@@ -59,10 +59,8 @@ int main(void) {
     SelHostScheduler scheduler;
     SelHostContext host_context;
     SelTimer timer = {0};
-    struct timeval tenth = {0, 100000};
     int host[2], mine[2];
     size_t i;
-    fd_set r;
     char name[64];
     ShmHandle *segment;
     void *block;
@@ -92,10 +90,6 @@ int main(void) {
     CHECK(SelSleep(&timer, 20) == 0 && SelDebugIsTimerActive(&timer) == 1);
     CHECK(SelSelect() == 0 && callbacks == 2);
     CHECK(SelDebugIsTimerActive(&timer) == 0);
-
-    FD_ZERO(&r);
-    FD_SET(host[0], &r);
-    CHECK(zarn_select(host[0] + 1, &r, NULL, NULL, &tenth) == 1 && FD_ISSET(host[0], &r));
     SelSetZG(NULL);
 
     greenthreads_init();

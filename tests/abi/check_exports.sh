@@ -1,4 +1,4 @@
-#!/bin/sh
+#!/bin/bash
 # Checks the shared library's dynamic section and exported symbols:
 #   check_exports.sh LIBRARY VERSION_SCRIPT SANITIZED(ON|OFF|"")
 set -eu
@@ -21,19 +21,12 @@ want=$(sed -e 's#/\*.*\*/##g' "$map" | tr ' ;' '\n\n' | grep -E '^[A-Za-z_][A-Za
 have=$(readelf --dyn-syms -W "$lib" | awk '$7 != "UND" && $5 != "LOCAL" && ($4 == "FUNC" || $4 == "OBJECT") {print $8}' |
        sed 's/@.*//' | sort -u)
 if [ "$want" != "$have" ]; then
-    echo "exported symbols differ from the version script:"
-    printf '%s\n' "$want" > /tmp/qorbu-want.$$
-    printf '%s\n' "$have" > /tmp/qorbu-have.$$
-    diff /tmp/qorbu-want.$$ /tmp/qorbu-have.$$ || true
-    rm -f /tmp/qorbu-want.$$ /tmp/qorbu-have.$$
+    echo "exported symbols differ from the version script (< wanted, > exported):"
+    diff <(echo "$want") <(echo "$have")
     fail=1
 fi
-
 # No C++ runtime, no exception machinery.
-if readelf --dyn-syms -W "$lib" | grep -E 'GLIBCXX|CXXABI|_Znw|_Zdl|_ZTI|_Unwind|__gxx_personality|__cxa_(throw|begin_catch|guard)' >/dev/null; then
-    echo "the library refers to the C++ runtime:"
-    readelf --dyn-syms -W "$lib" | grep -E 'GLIBCXX|CXXABI|_Znw|_Zdl|_ZTI|_Unwind|__gxx_personality|__cxa_(throw|begin_catch|guard)'
-    fail=1
-fi
+cxx=$(readelf --dyn-syms -W "$lib" | grep -E 'GLIBCXX|CXXABI|_Znw|_Zdl|_ZTI|_Unwind|__gxx_personality|__cxa_(throw|begin_catch|guard)' || true)
+[ -z "$cxx" ] || { echo "the library refers to the C++ runtime:"; echo "$cxx"; fail=1; }
 [ $fail = 0 ] && echo "exports ok: $(printf '%s\n' "$have" | wc -l) symbols"
 exit $fail

@@ -22,8 +22,6 @@ command -v snmpget >/dev/null || { echo "snmpget not installed (apt-get install 
 case_self_test() {
     "$DEMO" --self-test --clients 16 --rounds 32 >"$WORK/out" 2>"$WORK/err" || fail "--self-test exited $?"
     expect "$WORK/out" '^  connections +16 of 16 clients connected$'
-    expect "$WORK/out" '^  snmpget +open connections 16, bytes echoed [1-9][0-9]*, segment free [0-9]+$'
-    expect "$WORK/out" '^  second process +16 records, [1-9][0-9]* bytes'
     expect "$WORK/out" '^  result +PASS: ([0-9]+) of \1 checks held$'
     local pid; pid=$(sed -n 's/^qorbu-demo: pid \([0-9]*\),.*/\1/p' "$WORK/err")
     [ -n "$pid" ] && [ ! -e "/dev/shm/qorbu-demo-selftest-$pid" ] || fail "no start-up line, or the segment was left behind"

@@ -70,16 +70,12 @@ quiet "$W/host-cmake.log" cmake -S "$SRC/tests/packaging/host" -B "$W/host-cmake
 
 unset LD_LIBRARY_PATH
 quiet "$W/install.log" cmake --install "$W/build" --prefix "$W/prefix" || die "cmake --install"
-# qorbu-shm carries the allocator's internals itself; the demo loads the library.
+# The demo loads the library (qorbu-shm carries the allocator's internals itself).
 if [ -x "$W/prefix/bin/qorbu-demo" ]; then
     ldd "$W/prefix/bin/qorbu-demo" | grep -q "libqorbu\.so\.5 => $W/prefix/" ||
         fail "qorbu-demo does not load the library of its prefix: $(ldd "$W/prefix/bin/qorbu-demo")"
     "$W/prefix/bin/qorbu-demo" --help >/dev/null || fail "qorbu-demo from the prefix"
 fi
-SEGMENT=qorbu-packaging-$$
-"$W/prefix/bin/qorbu-shm" create "$SEGMENT" 4096 >/dev/null && "$W/prefix/bin/qorbu-shm" info "$SEGMENT" >/dev/null ||
-    fail "qorbu-shm from the prefix"
-"$W/prefix/bin/qorbu-shm" unlink "$SEGMENT" 2>/dev/null
 [ -f "$W/prefix/share/man/man1/qorbu-shm.1.gz" ] || fail "the prefix install lacks qorbu-shm(1)"
 [ ! -e "$W/prefix/share/doc" ] || fail "the prefix install holds the packages' Debian documents"
 

@@ -15,18 +15,6 @@
 
 namespace {
 
-int free_udp_port() {
-    const int s = socket(AF_INET, SOCK_DGRAM, 0);
-    sockaddr_in addr{};
-    addr.sin_family = AF_INET;
-    addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
-    socklen_t len = sizeof addr;
-    const bool bound = bind(s, reinterpret_cast<sockaddr *>(&addr), sizeof addr) == 0 &&
-                       getsockname(s, reinterpret_cast<sockaddr *>(&addr), &len) == 0;
-    close(s);
-    return bound ? ntohs(addr.sin_port) : -1;
-}
-
 struct Client {
     std::string text;
     bool closed = false;
@@ -47,8 +35,8 @@ int alarms = 0;
 TEST(NetSnmpAgent, SnmpgetReadsTheScalarAndAnAlarmFiresThroughSelSelect) {
     char dir[] = "/tmp/qorbu-snmp-XXXXXX";
     ASSERT_NE(mkdtemp(dir), nullptr);
-    const int port = free_udp_port();
-    ASSERT_GT(port, 0);
+    const int port =
+        ntohs(qorbu::test::Listener(0, false, SOCK_DGRAM).addr.sin_port); /* free once it closes */
     for (const char *name : {"SNMPCONFPATH", "SNMP_PERSISTENT_DIR", "HOME"}) setenv(name, dir, 1);
     setenv("MIBS", "", 1), setenv("MIBDIRS", "", 1);
     for (int option : {NETSNMP_DS_LIB_DONT_READ_CONFIGS, NETSNMP_DS_LIB_DISABLE_PERSISTENT_LOAD,

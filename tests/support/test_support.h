@@ -66,9 +66,10 @@ struct SocketPair {
     int fd[2] = {-1, -1};
 };
 
-/* A non-blocking TCP socket bound to an ephemeral loopback port. */
+/* A non-blocking socket bound to an ephemeral loopback port (TCP, listening, unless asked otherwise). */
 struct Listener {
-    explicit Listener(int backlog = 64, bool listening = true) {
+    explicit Listener(int backlog = 64, bool listening = true, int type = SOCK_STREAM)
+        : fd(socket(AF_INET, type, 0)) {
         addr.sin_family = AF_INET;
         addr.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
         socklen_t len = sizeof addr;
@@ -81,7 +82,7 @@ struct Listener {
     ~Listener() { close(fd); }
     Listener(const Listener &) = delete;
     const sockaddr *address() const { return reinterpret_cast<const sockaddr *>(&addr); }
-    int fd = socket(AF_INET, SOCK_STREAM, 0);
+    int fd;
     sockaddr_in addr{};
 };
 
