@@ -7,5 +7,5 @@ TEST(GreenThreadsInAnExecutableStackProgram, StacksAreExecutable) {
     greenthreads_init();
     const Greenthread *thread = greenthread_create([](void *) {}, nullptr);
     const auto base = reinterpret_cast<uintptr_t>(thread->context.uc_stack.ss_sp);
-    EXPECT_EQ(qorbu::test::mapping_at(base + static_cast<uintptr_t>(qorbu::gt::page_size)).perms, "rwxp");
+    EXPECT_EQ(qorbu::test::perms_at(base + static_cast<uintptr_t>(qorbu::gt::page_size)), "rwxp");
 }

@@ -195,9 +195,9 @@ TEST_F(GreenThreads, StacksAreGuardedAndNotExecutableAndOverflowFaultsOnTheThrea
     const auto base = reinterpret_cast<uintptr_t>(thread->context.uc_stack.ss_sp);
     const size_t size = thread->context.uc_stack.ss_size, page = static_cast<size_t>(page_size);
     EXPECT_EQ(size - page, std::max<size_t>(16384, page)) << "16 KiB in whole pages above the guard page";
-    EXPECT_TRUE(mapping_at(base).inaccessible());
-    EXPECT_EQ(mapping_at(base + page).perms, "rw-p");
-    EXPECT_EQ(mapping_at(base + size - 1).perms, "rw-p");
+    EXPECT_TRUE(perms_at(base) == "---p" || (kEmulated && perms_at(base).empty())) << "guard page";
+    EXPECT_EQ(perms_at(base + page), "rw-p");
+    EXPECT_EQ(perms_at(base + size - 1), "rw-p");
     EXPECT_EXIT(overflow(base), ::testing::ExitedWithCode(42), "");
 }
 

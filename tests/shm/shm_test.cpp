@@ -99,7 +99,7 @@ TEST_F(Shm, RefusedCallsChangeNothing) {
     EXPECT_EQ(heads(h), lists);
     EXPECT_EQ(OUTCOME(ShmUnlink(n)), failure(ENOENT)) << "a refused call made the object";
     close(h);
-    EXPECT_EQ(mapping_at(uintptr_t(reader->base)).perms, "r--s") << "read-only handles could write";
+    EXPECT_EQ(perms_at(uintptr_t(reader->base)), "r--s") << "read-only handles could write";
 }
 
 /* Objects a creator left half-made when it died, and headers that cannot be

@@ -107,24 +107,15 @@ inline int open_descriptor_count() {
 }
 
 /* Permissions ("rw-p", "---p", ...) of the mapping that holds addr; empty
- * when nothing is mapped there. qemu-user leaves inaccessible pages out. */
-struct Mapping {
-    std::string perms;
-    bool inaccessible() const { return perms == "---p" || (kEmulated && perms.empty()); }
-};
-inline Mapping mapping_at(uintptr_t addr) {
-    Mapping found;
+ * when nothing is mapped there (qemu-user leaves inaccessible pages out). */
+inline std::string perms_at(uintptr_t addr) {
     FILE *maps = fopen("/proc/self/maps", "r");
-    char line[512], perms[8];
-    unsigned long long low, high;
-    while (maps != nullptr && fgets(line, sizeof line, maps) != nullptr) {
-        if (sscanf(line, "%llx-%llx %7s", &low, &high, perms) == 3 && addr >= low && addr < high) {
-            found = {perms};
-            break;
-        }
-    }
+    char line[512], perms[8] = "";
+    unsigned long long low = 0, high = 0;
+    while (maps != nullptr && fgets(line, sizeof line, maps) != nullptr)
+        if (sscanf(line, "%llx-%llx %7s", &low, &high, perms) == 3 && addr >= low && addr < high) break;
     if (maps != nullptr) fclose(maps);
-    return found;
+    return addr >= low && addr < high ? perms : "";
 }
 
 inline double seconds_now() {
