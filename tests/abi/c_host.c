@@ -1,9 +1,8 @@
 /* A host written in C against the public headers and the shared library: it
  * defines none of the host functions, so the library's weak references stay
  * unresolved and the loop must skip the host's scheduler and Net-SNMP. The
- * build compiles it as C99, C11 and C17 with -pedantic-errors, once more with
- * no feature macros (QORBU_HEADERS_ONLY), and the packaging test builds it
- * against the installed packages. */
+ * build compiles it as C99, C11 and C17 with -pedantic-errors and no feature
+ * macros, and the packaging test builds it against the installed packages. */
 #include <greenthreads/greenthread.h>
 #include <nbio/nb.h>
 #include <selector/host.h>
@@ -21,7 +20,6 @@ LAYOUT(fd_entry, offsetof(SelFdEntry, lastActivity) == 8 && offsetof(SelFdEntry,
                      sizeof(SelFdEntry) == 24);
 #endif
 
-#ifndef QORBU_HEADERS_ONLY
 #include <dlfcn.h>
 #include <poll.h>
 #include <stdio.h>
@@ -113,4 +111,3 @@ int main(void) {
     puts(failures ? "c host: FAILED" : "c host: ok");
     return failures != 0;
 }
-#endif

@@ -58,7 +58,7 @@ LIBDIR=$(dirname "$(dirname "$PC")")
 export LD_LIBRARY_PATH=$LIBDIR
 # shellcheck disable=SC2046
 PKG_CONFIG_SYSROOT_DIR=$ROOT PKG_CONFIG_LIBDIR=$LIBDIR/pkgconfig sh -c 'pkg-config --modversion qorbu &&
-    cc -std=c11 -pedantic-errors -D_POSIX_C_SOURCE=200809L -Wall -Wextra -Werror -o "$1" "$2" $(pkg-config --cflags --libs qorbu)' \
+    cc -std=c11 -pedantic-errors -Wall -Wextra -Werror -o "$1" "$2" $(pkg-config --cflags --libs qorbu)' \
     sh "$W/host-pkgconfig" "$SRC/tests/abi/c_host.c" | grep -qx "$VERSION" || fail "the pkg-config build"
 ldd "$W/host-pkgconfig" | grep -q "$LIBDIR/libqorbu.so.5" || fail "the host does not load the unpacked library"
 "$W/host-pkgconfig" || fail "the pkg-config host exited $?"
