@@ -44,12 +44,9 @@ case_outside_client() {
     printf 'hello, qorbu\n' >&3
     local reply=; read -r -t 20 reply <&3
     [ "$reply" = "hello, qorbu" ] || fail "echo answered '$reply'"
-    [ "$(snmp_value 1)" = 1 ] || fail "SNMP open connections: '$(snmp_value 1)', expected 1"
-    [ "$(snmp_value 2)" = 13 ] || fail "SNMP bytes echoed: '$(snmp_value 2)', expected 13"
-    "$TOOL" info "$SEGMENT" >"$WORK/info" || fail "qorbu-shm info failed"
-    local free; free=$(awk '$1 == "free" { print $2 }' "$WORK/info")
-    [ "$(snmp_value 3)" = "$free" ] || fail "SNMP segment free '$(snmp_value 3)', qorbu-shm says '$free'"
-    [ "$free" -lt 1048576 ] || fail "the connection's record is not in the segment (free $free)"
+    [ "$(snmp_value 1) $(snmp_value 2)" = "1 13" ] || fail "SNMP: open connections, bytes echoed not 1 13"
+    local free; free=$("$TOOL" info "$SEGMENT" | awk '$1 == "free" { print $2 }')
+    [ "$(snmp_value 3)" = "$free" ] && [ "$free" -lt 1048576 ] || fail "SNMP segment free: qorbu-shm says '$free'"
 
     kill -TERM "$DAEMON_PID"
     for _ in $(seq 1 200); do kill -0 "$DAEMON_PID" 2>/dev/null || break; sleep 0.1; done

@@ -155,10 +155,8 @@ TEST_F(GreenThreads, RunLoopWaitsInTheSelectorOnlyWhenEveryThreadIsBlocked) {
     ASSERT_EQ(SelUseEpoll(), 0);
     Pipe late;
     set_nonblocking(late.r);
-    auto reader = [&] {
-        char byte;
-        trace += nb_read(late.r, &byte, 1) == 1 ? 'R' : '!';
-    };
+    char byte;
+    auto reader = [&] { trace += nb_read(late.r, &byte, 1) == 1 ? 'R' : '!'; };
     spawn(&reader);
     const uint32_t passes_before = SelCurrentContext()->pass_count;
     std::thread writer([&] { usleep(200'000), late.fill(); });

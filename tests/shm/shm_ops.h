@@ -6,7 +6,6 @@
 #include "shm/shm.h"
 
 #include <algorithm>
-#include <bit>
 #include <cerrno>
 #include <cstring>
 #include <map>

@@ -6,7 +6,6 @@
 
 #include <csignal>
 #include <deque>
-#include <fcntl.h>
 #include <functional>
 #include <optional>
 #include <random>

@@ -8,7 +8,6 @@
 
 #include <cstdlib>
 #include <filesystem>
-#include <string>
 
 #include "selector/sel.h"
 #include "support/test_support.h"
