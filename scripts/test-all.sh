@@ -2,8 +2,8 @@
 # The whole test suite on a fresh Debian 12 machine: installs what it needs,
 # checks that every C and C++ file is formatted as .clang-format says, then
 # builds and runs ctest for x86_64, i386 (qemu), armhf (qemu) and the
-# address/undefined-behaviour sanitizers, and fuzzes the allocator briefly
-# (preset fuzz: clang, the fuzzer run for 30 s as its ctest).
+# address/undefined-behaviour sanitizers, and fuzzes the allocator and the
+# timer heap briefly (preset fuzz: clang, each fuzzer run for 20 s as a ctest).
 set -uo pipefail
 cd "$(dirname "$0")/.."
 source scripts/require-packages.sh
