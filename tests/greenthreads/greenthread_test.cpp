@@ -41,8 +41,8 @@ inline bool run_for(double seconds) {
     return !stopped;
 }
 inline unsigned registered(int fd) {
-    const SelContext *ctx = SelCurrentContext();
-    return fd < 0 || fd >= ctx->fdTableSize ? 0 : ctx->fdTable[fd].events;
+    const SelFdEntry *entry = SelFdFind(SelCurrentContext(), fd);
+    return entry != nullptr ? entry->events : 0;
 }
 
 class GreenThreads : public ::testing::Test {
